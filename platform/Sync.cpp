@@ -1,0 +1,64 @@
+#include "platform/Sync.h"
+
+#include "platform/Trace.h"
+
+namespace tidelink::platform {
+
+void RecursiveMutex::Lock(const char* label, int timeoutMs) {
+    const auto limit = std::chrono::milliseconds(timeoutMs > 0 ? timeoutMs : kDefaultLockTimeoutMs);
+    while (!mMutex.try_lock_for(limit)) {
+        const char* holder = mHolder.load();
+        TL_TRACE("platform", 0) << "RecursiveMutex: \"" << (label ? label : "?") << "\" waited "
+                                << limit.count() << " ms for the lock held by \""
+                                << (holder ? holder : "?") << "\"; still waiting";
+    }
+    if (mDepth++ == 0) mHolder.store(label);
+}
+
+void RecursiveMutex::Unlock() {
+    if (--mDepth == 0) mHolder.store(nullptr);
+    mMutex.unlock();
+}
+
+bool SyncPoint::Arrive(int timeoutMs) {
+    std::unique_lock lock(mMutex);
+    if (++mArrived >= mParties) {
+        mCond.notify_all();
+        return true;
+    }
+    auto done = [this] { return mArrived >= mParties; };
+    if (timeoutMs < 0) {
+        mCond.wait(lock, done);
+        return true;
+    }
+    return mCond.wait_for(lock, std::chrono::milliseconds(timeoutMs), done);
+}
+
+void Gate::Open() {
+    {
+        std::lock_guard lock(mMutex);
+        mOpen = true;
+    }
+    mCond.notify_all();
+}
+
+void Gate::Close() {
+    std::lock_guard lock(mMutex);
+    mOpen = false;
+}
+
+bool Gate::IsOpen() {
+    std::lock_guard lock(mMutex);
+    return mOpen;
+}
+
+bool Gate::Wait(int timeoutMs) {
+    std::unique_lock lock(mMutex);
+    if (timeoutMs < 0) {
+        mCond.wait(lock, [this] { return mOpen; });
+        return true;
+    }
+    return mCond.wait_for(lock, std::chrono::milliseconds(timeoutMs), [this] { return mOpen; });
+}
+
+}  // namespace tidelink::platform
