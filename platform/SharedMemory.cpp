@@ -1,5 +1,6 @@
 #include "platform/SharedMemory.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
@@ -13,6 +14,24 @@ namespace {
 std::string ShmPath(const std::string& name) { return "/" + name; }
 
 }  // namespace
+
+std::vector<std::string> ListSharedMemoryNames(const std::string& prefix) {
+    std::vector<std::string> names;
+    DIR* dir = ::opendir("/dev/shm");
+    if (dir == nullptr) return names;
+    const uid_t me = ::getuid();
+    while (dirent* e = ::readdir(dir)) {
+        const std::string name = e->d_name;
+        if (name.compare(0, prefix.size(), prefix) != 0) continue;
+        struct stat st {};
+        if (::fstatat(::dirfd(dir), e->d_name, &st, AT_SYMLINK_NOFOLLOW) == 0 && st.st_uid == me &&
+            S_ISREG(st.st_mode)) {
+            names.push_back(name);
+        }
+    }
+    ::closedir(dir);
+    return names;
+}
 
 MemoryMappedFile::~MemoryMappedFile() { Close(); }
 

@@ -8,6 +8,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <string>
+#include <vector>
 
 #include "platform/Export.h"
 
@@ -17,6 +18,9 @@ namespace tidelink::platform {
 inline constexpr uint32_t kMMFWritable = 0x01;  // map for writing as well as reading
 inline constexpr uint32_t kMMFReplaceStale = 0x02;  // Init: replace an object of ours left under the name
 inline constexpr uint32_t kMMFReadOnly = 0x20;  // Open: map read-only
+
+// Names of this user's shared-memory objects that start with |prefix|.
+TIDELINK_EXPORT std::vector<std::string> ListSharedMemoryNames(const std::string& prefix);
 
 class TIDELINK_EXPORT MemoryMappedFile {
 public:

@@ -92,6 +92,7 @@ StartResult ManagerService::Start(std::string& error) {
         mLastActivity = NowSeconds();
     }
     if (mOptions.publishPort) {
+        SweepStalePortFiles();
         const std::string name = GetTideLinkManagerPortFileName(GetCurrentProcessID());
         // A mapping under our own name can only be left by a dead process that had our pid.
         if (!mPortFile.Init(name, 4, kMMFReplaceStale)) {
@@ -99,12 +100,41 @@ StartResult ManagerService::Start(std::string& error) {
             return StartResult::Failed;
         }
         auto* p = static_cast<uint8_t*>(mPortFile.GetAddress());
-        const uint32_t port = mServer->GetPort();
+        const uint32_t port = mOptions.publishedPortOverride.value_or(mServer->GetPort());
         for (int i = 0; i < 4; ++i) p[i] = static_cast<uint8_t>(port >> (8 * i));
     }
     TL_TRACE(kCat, 3) << "Link manager " << CSVersionPortNumberString() << " serving on 127.0.0.1:"
                       << mServer->GetPort();
     return StartResult::Started;
+}
+
+// Port mappings outlive a manager killed without warning. Remove those of dead managers of this
+// version and user. A name is "tlm" + pid + version, so the digits alone could also be read as
+// a shorter pid followed by another version: a name is kept when any live link manager's pid
+// is a prefix of its digits.
+void ManagerService::SweepStalePortFiles() {
+    const std::string suffix = CSVersionPortNumberString();
+    const auto live = GetProcessIDsForName(kTideLinkManagerName);
+    for (const auto& name : ListSharedMemoryNames("tlm")) {
+        if (name.size() <= 3 + suffix.size() ||
+            name.compare(name.size() - suffix.size(), suffix.size(), suffix) != 0) {
+            continue;
+        }
+        const std::string digits = name.substr(3, name.size() - 3 - suffix.size());
+        if (digits.empty() || digits.size() > 10 ||
+            digits.find_first_not_of("0123456789") != std::string::npos) {
+            continue;
+        }
+        const auto pid = static_cast<uint32_t>(std::stoull(digits));
+        if (pid == GetCurrentProcessID() || IsProcessAlive(pid)) continue;
+        bool ambiguous = false;
+        for (uint32_t other : live) {
+            if (digits.rfind(std::to_string(other), 0) == 0) ambiguous = true;
+        }
+        if (!ambiguous && MemoryMappedFile::Remove(name)) {
+            TL_TRACE(kCat, 3) << "Removed the port mapping " << name << " of a dead link manager";
+        }
+    }
 }
 
 void ManagerService::OnSession(const SessionPtr& session) {

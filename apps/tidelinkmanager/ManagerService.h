@@ -9,6 +9,7 @@
 #include <condition_variable>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -25,6 +26,8 @@ struct ManagerOptions {
     bool publishPort = true;
     // Hold the per-user, per-version instance lock (turned off by in-process tests).
     bool singleInstance = true;
+    // Test seam: publish this value instead of the real port (a "manager" that seems not running).
+    std::optional<uint32_t> publishedPortOverride;
 };
 
 class ManagerService;
@@ -63,6 +66,7 @@ public:
     double UptimeSeconds() const;
 
 private:
+    void SweepStalePortFiles();
     void OnSession(const platform::SessionPtr& session);
 
     ManagerOptions mOptions;

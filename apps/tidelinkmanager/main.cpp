@@ -36,6 +36,10 @@ int main(int argc, char** argv) {
                 std::fprintf(stderr, "tidelinkmanager: bad --idle-exit value '%s'\n", argv[i]);
                 return 2;
             }
+        } else if (arg == "--debug-publish-port" && i + 1 < argc) {
+            // Test seam: publish a chosen value instead of the port, without the instance lock.
+            options.publishedPortOverride = static_cast<uint32_t>(std::strtoul(argv[++i], nullptr, 0));
+            options.singleInstance = false;
         } else if (arg == "--version") {
             std::printf("tidelinkmanager version %s (protocol %s)\n", TIDELINK_VERSION_STRING,
                         CSVersionPortNumberString().c_str());
