@@ -1,0 +1,13 @@
+#!/usr/bin/env bash
+# The main job: builds tidelink if needed, then reaches the link manager (starting it) and
+# describes it.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+scripts/install-deps.sh
+if [ ! -x build/release/bin/tidelink ] || [ -n "$(find CMakeLists.txt apps platform tidelink -newer build/release/bin/tidelink -print -quit 2>/dev/null)" ]; then
+  echo "== building (release)" >&2
+  cmake --preset release >/dev/null
+  cmake --build --preset release -j "$(nproc)"
+fi
+echo "== tidelink status" >&2
+build/release/bin/tidelink status "$@"
