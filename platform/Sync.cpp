@@ -6,18 +6,33 @@ namespace tidelink::platform {
 
 void RecursiveMutex::Lock(const char* label, int timeoutMs) {
     const auto limit = std::chrono::milliseconds(timeoutMs > 0 ? timeoutMs : kDefaultLockTimeoutMs);
-    while (!mMutex.try_lock_for(limit)) {
-        const char* holder = mHolder.load();
+    const auto me = std::this_thread::get_id();
+    std::unique_lock lock(mMutex);
+    if (mDepth > 0 && mOwner == me) {
+        ++mDepth;
+        return;
+    }
+    while (!mFree.wait_for(lock, limit, [this] { return mDepth == 0; })) {
+        const char* holder = mHolder;
+        lock.unlock();  // the trace sink is outside code
         TL_TRACE("platform", 0) << "RecursiveMutex: \"" << (label ? label : "?") << "\" waited "
                                 << limit.count() << " ms for the lock held by \""
                                 << (holder ? holder : "?") << "\"; still waiting";
+        lock.lock();
     }
-    if (mDepth++ == 0) mHolder.store(label);
+    mOwner = me;
+    mDepth = 1;
+    mHolder = label;
 }
 
 void RecursiveMutex::Unlock() {
-    if (--mDepth == 0) mHolder.store(nullptr);
-    mMutex.unlock();
+    {
+        std::lock_guard lock(mMutex);
+        if (--mDepth > 0) return;
+        mOwner = std::thread::id();
+        mHolder = nullptr;
+    }
+    mFree.notify_one();
 }
 
 bool SyncPoint::Arrive(int timeoutMs) {

@@ -40,9 +40,13 @@ public:
     };
 
 private:
-    std::recursive_timed_mutex mMutex;
-    std::atomic<const char*> mHolder{nullptr};
-    int mDepth = 0;  // guarded by mMutex
+    // A plain mutex and condition variable rather than std::recursive_timed_mutex, whose timed
+    // wait the thread sanitizer cannot see.
+    std::mutex mMutex;
+    std::condition_variable mFree;
+    std::thread::id mOwner;       // guarded by mMutex
+    int mDepth = 0;               // guarded by mMutex
+    const char* mHolder = nullptr;  // guarded by mMutex
 };
 
 // A rendezvous of a fixed number of parties: each Arrive blocks until all have arrived (or the

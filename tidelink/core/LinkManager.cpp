@@ -179,6 +179,7 @@ SessionPtr LaunchTidelinkManager(const SocketTransportPtr& transport) {
 
     for (;;) {
         if (session && ReadManagerPort(pid) != s.managerPort) {
+            session->Close();  // its pending probe holds it; closing completes the probe
             session.reset();
             connected = std::make_shared<std::atomic<bool>>(false);
             s.managerPort = 0;
