@@ -50,10 +50,10 @@ bool SyncPoint::Arrive(int timeoutMs) {
 }
 
 void Gate::Open() {
-    {
-        std::lock_guard lock(mMutex);
-        mOpen = true;
-    }
+    // Notify under the lock: a waiter may destroy the gate as soon as it sees it open, so Open
+    // must not touch it after unlocking.
+    std::lock_guard lock(mMutex);
+    mOpen = true;
     mCond.notify_all();
 }
 

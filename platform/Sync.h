@@ -65,7 +65,8 @@ private:
     int mArrived = 0;
 };
 
-// A gate: closed or open; Wait blocks while it is closed.
+// A gate: closed or open; Wait blocks while it is closed. A waiter may destroy the gate as soon
+// as Wait returns true.
 class TIDELINK_EXPORT Gate {
 public:
     explicit Gate(bool open = false) : mOpen(open) {}

@@ -6,7 +6,9 @@
 #include <sys/socket.h>
 
 #include <boost/asio.hpp>
+#include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <thread>
 
@@ -28,6 +30,11 @@ constexpr size_t kMaxSessionsPerServer = 4096;
 constexpr size_t kInitialReadBuffer = 64 * 1024;
 
 std::atomic<RequestId> gNextRequestId{1};
+
+// Replies made while a session handles a batch of incoming messages are gathered and sent with
+// one write at the end of the batch (the session whose batch this thread is handling).
+thread_local const void* tReplyBatchOwner = nullptr;
+constexpr size_t kMaxReplyBatch = 256 * 1024;
 
 struct Pending {
     SuccessFn ok;
@@ -61,7 +68,10 @@ namespace detail {
 class TransportCore {
 public:
     TransportCore() : mIo(std::make_shared<asio::io_context>()), mWork(asio::make_work_guard(*mIo)) {
-        const unsigned n = std::max(2u, std::min(4u, std::thread::hardware_concurrency()));
+        unsigned n = std::max(2u, std::min(4u, std::thread::hardware_concurrency()));
+        if (const char* env = std::getenv("TIDELINK_IO_THREADS")) {
+            n = static_cast<unsigned>(std::clamp(std::atoi(env), 1, 16));
+        }
         for (unsigned i = 0; i < n; ++i) {
             mThreads.emplace_back([io = mIo] {
                 for (;;) {
@@ -253,22 +263,30 @@ public:
     }
 
     void SendReply(RequestId id, const Value& result) {
-        thread_local wire::Buffer frame;
-        frame.clear();
+        const bool batched = tReplyBatchOwner == this;
+        thread_local wire::Buffer scratch;
+        wire::Buffer& frame = batched ? mReplyBatch : scratch;
+        if (!batched) frame.clear();
         try {
             wire::AppendReply(frame, id, result);
         } catch (const wire::WireError& e) {
             TL_TRACE(kCat, 1) << "Cannot send reply: " << e.what();
             return SendErrorReply(id, kErrorRequestRefused, e.what());
         }
-        Write(frame.data(), frame.size());
+        if (!batched) {
+            Write(frame.data(), frame.size());
+        } else if (mReplyBatch.size() >= kMaxReplyBatch) {
+            FlushReplies();
+        }
     }
 
     void SendErrorReply(RequestId id, int32_t code, const std::string& message) {
-        thread_local wire::Buffer frame;
-        frame.clear();
+        const bool batched = tReplyBatchOwner == this;
+        thread_local wire::Buffer scratch;
+        wire::Buffer& frame = batched ? mReplyBatch : scratch;
+        if (!batched) frame.clear();
         wire::AppendErrorReply(frame, id, code, message.substr(0, 64 * 1024));
-        Write(frame.data(), frame.size());
+        if (!batched) Write(frame.data(), frame.size());
     }
 
     void SetDispatcher(std::shared_ptr<MessageDispatcher> d) {
@@ -346,6 +364,23 @@ private:
         return true;
     }
 
+    void FlushReplies() {
+        if (mReplyBatch.empty()) return;
+        Write(mReplyBatch.data(), mReplyBatch.size());
+        mReplyBatch.clear();
+    }
+
+    // Marks this thread as handling the session's batch for as long as it lives.
+    struct BatchScope {
+        explicit BatchScope(SessionImpl* s) : session(s), previous(tReplyBatchOwner) { tReplyBatchOwner = s; }
+        ~BatchScope() {
+            tReplyBatchOwner = previous;
+            session->FlushReplies();
+        }
+        SessionImpl* session;
+        const void* previous;
+    };
+
     void ContinueWrite() {
         asio::async_write(mSocket, asio::buffer(mOut),
                           asio::bind_executor(mStrand, [self = shared_from_this()](auto ec, size_t) {
@@ -383,6 +418,7 @@ private:
         }
         mReadLen += n;
         size_t pos = 0;
+        BatchScope batch(this);
         try {
             if (!mAuthenticated) {
                 if (mReadLen < wire::kHelloSize) return StartRead();
@@ -483,6 +519,7 @@ private:
     wire::Buffer mQueued;
 
     std::vector<uint8_t> mReadBuf;  // strand only
+    wire::Buffer mReplyBatch;       // strand only
     size_t mReadLen = 0;
 };
 
