@@ -439,15 +439,9 @@ private:
             while (mReadLen - pos >= wire::kFrameHeaderSize) {
                 const uint32_t len = wire::ReadFrameLength(mReadBuf.data() + pos);
                 const size_t total = wire::kFrameHeaderSize + len;
-                if (mReadLen - pos < total) {
-                    if (mReadBuf.size() < total) {
-                        std::memmove(mReadBuf.data(), mReadBuf.data() + pos, mReadLen - pos);
-                        mReadLen -= pos;
-                        pos = 0;
-                        mReadBuf.resize(total + 4096);
-                    }
-                    break;
-                }
+                // Incomplete: wait for more. The buffer grows with what actually arrives, never
+                // to the announced size up front, so a bare header cannot reserve 16 MiB.
+                if (mReadLen - pos < total) break;
                 wire::Message m = wire::DecodeBody(mReadBuf.data() + pos + wire::kFrameHeaderSize, len);
                 pos += total;
                 Handle(std::move(m));
