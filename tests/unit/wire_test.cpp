@@ -288,7 +288,8 @@ TEST(Wire, AnnouncedSizesAreNotTrustedBeforeTheBytesArrive) {
     EXPECT_FALSE(threw);
 
     for (const auto& body : cases) {
-        EXPECT_LT(largestWhileDecoding(body, threw), 64u * 1024u) << "body starting " << int(body[0]);
+        EXPECT_LT(largestWhileDecoding(body, threw), 64u * 1024u)
+            << "body starting " << int(body[0]);
         EXPECT_TRUE(threw);
     }
 }
