@@ -401,9 +401,10 @@ TEST(Localize, KeyedTextAndArguments) {
 
 // ---- runtime folder ----
 
-class RuntimeDir : public ::testing::Test {
+class RuntimeDir : public TraceCapture {
 protected:
     void SetUp() override {
+        TraceCapture::SetUp();
         char path[] = "/tmp/tidelink-test-runtime-XXXXXX";
         ASSERT_NE(::mkdtemp(path), nullptr);
         mBase = path;
@@ -414,6 +415,7 @@ protected:
             if (::unlink(p.c_str()) != 0) ::rmdir(p.c_str());
         }
         ::rmdir(mBase.c_str());
+        TraceCapture::TearDown();
     }
     std::string mBase;
 };
@@ -436,6 +438,10 @@ TEST_F(RuntimeDir, FolderOpenToOthersOrALinkIsRefused) {
     {
         ScopedEnv env("TIDELINK_RUNTIME_DIR", open);
         EXPECT_EQ(GetRuntimeDir(), "");
+        const auto lines = Lines();
+        ASSERT_EQ(lines.size(), 1u);
+        EXPECT_EQ(lines[0].level, 0);
+        EXPECT_NE(lines[0].line.find(open), std::string::npos) << lines[0].line;
     }
     const std::string target = mBase + "/target";
     const std::string link = mBase + "/link";
