@@ -8,6 +8,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <mutex>
+#include <vector>
 
 #include "platform/Process.h"
 #include "platform/Trace.h"
@@ -20,16 +21,23 @@ namespace tidelink::platform {
 namespace {
 
 SuiteVersionInfo ParseSuiteVersion(const char* text) {
-    SuiteVersionInfo v{TIDELINK_DEFAULT_SUITE_MAJOR, 0, 0};
-    if (text == nullptr || *text == '\0') return v;
+    const SuiteVersionInfo fallback{TIDELINK_DEFAULT_SUITE_MAJOR, 0, 0};
+    if (text == nullptr || *text == '\0') return fallback;
+    SuiteVersionInfo v;
     int32_t* fields[] = {&v.major, &v.minor, &v.patch};
-    v = SuiteVersionInfo{};
     const char* p = text;
-    for (int i = 0; i < 3 && *p; ++i) {
+    for (int i = 0; i < 3; ++i) {
         char* end = nullptr;
         errno = 0;
         const long n = std::strtol(p, &end, 10);
-        if (end == p || errno != 0 || n < 0 || n > INT32_MAX) break;
+        if (end == p || errno != 0 || n < 0 || n > INT32_MAX || *p == '-' || *p == '+' || *p == ' ') {
+            // An unreadable major number keeps the built-in version; later fields stay 0.
+            if (i == 0) {
+                TL_TRACE("platform", 0) << "Ignoring TIDELINK_SUITE_VERSION \"" << text << "\"";
+                return fallback;
+            }
+            break;
+        }
         *fields[i] = static_cast<int32_t>(n);
         p = end;
         if (*p != '.') break;
@@ -143,7 +151,9 @@ int64_t GetDebugEntryInt(std::string_view name, int64_t defaultValue) {
     if (!entry) return defaultValue;
     try {
         size_t used = 0;
-        const long long v = std::stoll(*entry, &used, 0);
+        // Decimal, or hexadecimal with 0x; a leading zero does not mean octal.
+        const bool hex = entry->size() > 2 && (*entry)[0] == '0' && ((*entry)[1] == 'x' || (*entry)[1] == 'X');
+        const long long v = std::stoll(*entry, &used, hex ? 16 : 10);
         if (used != entry->size()) return defaultValue;
         return v;
     } catch (...) {
@@ -169,15 +179,21 @@ WString Localize(std::string_view keyed, std::initializer_list<WString> args) {
         const auto eq = text.find('=');
         text = eq == std::string_view::npos ? std::string_view() : text.substr(eq + 1);
     }
-    WString out = ToUTF16(text);
-    size_t index = 0;
-    for (const auto& arg : args) {
-        const WString marker = u"@" + WString(1, static_cast<char16_t>(u'0' + index));
-        for (size_t pos = out.find(marker); pos != WString::npos;
-             pos = out.find(marker, pos + arg.size())) {
-            out.replace(pos, marker.size(), arg);
+    const WString in = ToUTF16(text);
+    const std::vector<WString> values(args);
+    // One pass: text taken from an argument is never searched for markers again.
+    WString out;
+    out.reserve(in.size());
+    for (size_t i = 0; i < in.size(); ++i) {
+        if (in[i] == u'@' && i + 1 < in.size() && in[i + 1] >= u'0' && in[i + 1] <= u'9') {
+            const size_t index = static_cast<size_t>(in[i + 1] - u'0');
+            if (index < values.size()) {
+                out += values[index];
+                ++i;
+                continue;
+            }
         }
-        if (++index == 10) break;
+        out.push_back(in[i]);
     }
     return out;
 }

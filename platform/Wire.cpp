@@ -193,6 +193,10 @@ Message DecodeBody(const uint8_t* data, size_t size) {
             if (!err.is_array() || err.size() != 2 || !err[0].is_number_integer() || !err[1].is_string()) {
                 throw WireError("malformed error in reply");
             }
+            // Unsigned values past INT64_MAX would wrap when read as signed.
+            if (err[0].is_number_unsigned() && err[0].get<uint64_t>() > static_cast<uint64_t>(INT32_MAX)) {
+                throw WireError("error code out of range");
+            }
             const auto code = err[0].get<int64_t>();
             if (code < INT32_MIN || code > INT32_MAX) throw WireError("error code out of range");
             m.isError = true;

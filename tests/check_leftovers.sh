@@ -1,21 +1,32 @@
 #!/usr/bin/env bash
-# Fails when a link manager started by the test suite still runs, or when shared memory of a test
-# suite version (9xxxxx) is left in /dev/shm.
+# Fails when a link manager of this test run still runs, or when shared memory of it is left in
+# /dev/shm. Each integration test process records its suite version in the folder given as $1;
+# the records are consumed here.
 set -u
+records=${1:?record folder}
 status=0
-for exe in /proc/[0-9]*/exe; do
-  pid=${exe#/proc/}; pid=${pid%/exe}
-  target=$(readlink "$exe" 2>/dev/null) || continue
-  case "${target% (deleted)}" in */tidelinkmanager) ;; *) continue ;; esac
-  if tr '\0' '\n' < "/proc/$pid/environ" 2>/dev/null | grep -qx 'TIDELINK_TEST_SUITE=1'; then
-    echo "left running: tidelinkmanager pid $pid"
+shopt -s nullglob
+versions=()
+for f in "$records"/*; do versions+=("$(basename "$f")"); done
+for v in "${versions[@]}"; do
+  for exe in /proc/[0-9]*/exe; do
+    pid=${exe#/proc/}; pid=${pid%/exe}
+    target=$(readlink "$exe" 2>/dev/null) || continue
+    case "${target% (deleted)}" in */tidelinkmanager) ;; *) continue ;; esac
+    if tr '\0' '\n' < "/proc/$pid/environ" 2>/dev/null | grep -qx "TIDELINK_SUITE_VERSION=$v"; then
+      echo "left running: tidelinkmanager pid $pid (suite version $v)"
+      status=1
+    fi
+  done
+  for name in /dev/shm/*"$v".0 /dev/shm/*"$v".0\(Beta\); do
+    echo "left in /dev/shm: ${name#/dev/shm/}"
     status=1
-  fi
+  done
 done
-left=$(ls /dev/shm 2>/dev/null | grep -E '^(tlm|tidelink)' | grep -E '9[0-9]{5}\.0(\(Beta\))?$|^tidelink-test-' || true)
-if [ -n "$left" ]; then
-  echo "left in /dev/shm:"; echo "$left"
+for name in /dev/shm/tidelink-test-*; do
+  echo "left in /dev/shm: ${name#/dev/shm/}"
   status=1
-fi
-[ $status -eq 0 ] && echo "no process or shared memory of the tests left behind"
+done
+rm -f "$records"/*
+[ $status -eq 0 ] && echo "no process or shared memory of the ${#versions[@]} test processes left behind"
 exit $status

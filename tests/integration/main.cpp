@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <string>
 
 #include "Harness.h"
@@ -40,6 +41,11 @@ int main(int argc, char** argv) {
     // A manager the test forgets still goes away by itself.
     ::setenv("TIDELINK_MANAGER_IDLE_EXIT", "20", 1);
     ::setenv("TIDELINK_TEST_SUITE", "1", 1);
+    // Recorded for the suite's final leftover check, which looks at this run's versions only.
+    if (const char* records = std::getenv("TIDELINK_TEST_RECORD_DIR")) {
+        std::filesystem::create_directories(records);
+        std::ofstream(std::string(records) + "/" + version);
+    }
     ::testing::InitGoogleTest(&argc, argv);
     ::testing::AddGlobalTestEnvironment(new LeftoverCheck());
     return RUN_ALL_TESTS();

@@ -348,7 +348,8 @@ TEST_F(DebugDatabase, FileWithCommentsAndSpaces) {
           "TIDELINK_TEST_EMPTY=\n"
           "#TIDELINK_TEST_COMMENTED=1\n"
           "no equals sign here\n"
-          "TIDELINK_TEST_HEX=0x10\n");
+          "TIDELINK_TEST_HEX=0x10\n"
+          "TIDELINK_TEST_LEADING_ZERO=010\n");
     EXPECT_EQ(GetDebugEntry("TIDELINK_TEST_NUMBER"), "42");
     EXPECT_EQ(GetDebugEntry("TIDELINK_TEST_TEXT"), "two words");
     EXPECT_EQ(GetDebugEntry("TIDELINK_TEST_EMPTY"), "");
@@ -356,6 +357,7 @@ TEST_F(DebugDatabase, FileWithCommentsAndSpaces) {
     EXPECT_EQ(GetDebugEntry("TIDELINK_TEST_MISSING"), std::nullopt);
     EXPECT_EQ(GetDebugEntryInt("TIDELINK_TEST_NUMBER", -1), 42);
     EXPECT_EQ(GetDebugEntryInt("TIDELINK_TEST_HEX", -1), 16);
+    EXPECT_EQ(GetDebugEntryInt("TIDELINK_TEST_LEADING_ZERO", -1), 10);  // not octal
     EXPECT_EQ(GetDebugEntryInt("TIDELINK_TEST_MISSING", -1), -1);
 
     // The file is read on each lookup.
@@ -393,6 +395,7 @@ TEST(Localize, KeyedTextAndArguments) {
     EXPECT_EQ(Localize("$$$/tidelink/Test/Two=@1 before @0", {u"a", u"b"}), u"b before a");
     // An argument that contains its own marker is not expanded again.
     EXPECT_EQ(Localize("$$$/tidelink/Test/Self=<@0>", u"@0@0"), u"<@0@0>");
+    EXPECT_EQ(Localize("$$$/tidelink/Test/Cross=@0 @1", {u"@1", u"x"}), u"@1 x");
     EXPECT_EQ(Localize("$$$/tidelink/Test/Eq=a=b"), u"a=b");
     EXPECT_EQ(Localize("Not keyed at all"), u"Not keyed at all");
     EXPECT_EQ(Localize("$$/almost=keyed"), u"$$/almost=keyed");
