@@ -159,8 +159,8 @@ void from_json(const Value& j, ColorProfile& p) {
 
 Guid ColorSpace::ToGuid() const {
     std::string key;
-    const auto& profile = mBaseProfile.GetGuid().Bytes();
-    key.append(reinterpret_cast<const char*>(profile.data()), profile.size());
+    const Guid profile = mBaseProfile.GetGuid();
+    key.append(reinterpret_cast<const char*>(profile.Bytes().data()), profile.Bytes().size());
     AppendU64(key, mBaseProfileType);
     key.push_back(mLinearized ? 1 : 0);
     return NameBasedGuid(kColorSpaceNamespace, key);
