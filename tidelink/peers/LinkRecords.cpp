@@ -202,6 +202,7 @@ bool operator==(const SourceInfo& a, const SourceInfo& b) {
 
 void to_json(Value& j, const SourceInfo& r) {
     j = Value::object();
+    j.get_ref<Value::object_t&>().reserve(40);  // every key is written: grow once
     j["parentprojectfile"] = FileToWire(r.mParentProjectFile);
     j["farlandassetrequestinfo"] = r.mFarlandAssetRequestInfo;
     j["farlandproductionrequestinfo"] = r.mFarlandProductionRequestInfo;
