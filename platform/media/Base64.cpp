@@ -23,7 +23,8 @@ std::string EncodeBase64(const std::vector<uint8_t>& bytes) {
     out.reserve((bytes.size() + 2) / 3 * 4);
     size_t i = 0;
     for (; i + 3 <= bytes.size(); i += 3) {
-        const uint32_t n = (uint32_t(bytes[i]) << 16) | (uint32_t(bytes[i + 1]) << 8) | bytes[i + 2];
+        const uint32_t n =
+            (uint32_t(bytes[i]) << 16) | (uint32_t(bytes[i + 1]) << 8) | bytes[i + 2];
         out.push_back(kAlphabet[(n >> 18) & 63]);
         out.push_back(kAlphabet[(n >> 12) & 63]);
         out.push_back(kAlphabet[(n >> 6) & 63]);

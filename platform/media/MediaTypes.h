@@ -69,7 +69,9 @@ template <class T>
 struct PointT {
     T mX{};
     T mY{};
-    friend bool operator==(const PointT& a, const PointT& b) { return a.mX == b.mX && a.mY == b.mY; }
+    friend bool operator==(const PointT& a, const PointT& b) {
+        return a.mX == b.mX && a.mY == b.mY;
+    }
     friend bool operator!=(const PointT& a, const PointT& b) { return !(a == b); }
 };
 

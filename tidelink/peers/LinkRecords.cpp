@@ -56,7 +56,9 @@ void to_json(Value& j, const FarlandServerConnectInfo& r) {
 void from_json(const Value& j, FarlandServerConnectInfo& r) {
     RequireObject(j);
     FarlandServerConnectInfo out;
-    if (const Value* v = FindMember(j, "mServerDiscoveryURL")) out.mServerDiscoveryURL = ReadString(*v);
+    if (const Value* v = FindMember(j, "mServerDiscoveryURL")) {
+        out.mServerDiscoveryURL = ReadString(*v);
+    }
     out.mEARPort = ReadString(MemberOrNull(j, "mEARPort"));
     out.mUserName = ReadString(MemberOrNull(j, "mUserName"));
     out.mAuthToken = ReadString(MemberOrNull(j, "mAuthToken"));
@@ -260,12 +262,15 @@ void from_json(const Value& j, SourceInfo& r) {
          [&](const Value& v) { out.mMediaProducerDescription = ReadWString(v); });
     each("id", [&](const Value& v) { out.mID = GuidFromWire(v); });
     each("duration", [&](const Value& v) { out.mDuration = RatioTimeFromValue(v); });
-    each("pixelaspectratio", [&](const Value& v) { out.mPixelAspectRatio = v.get<PixelAspectRatio>(); });
-    each("alphachanneltype", [&](const Value& v) { out.mAlphaChannelType = ReadEnum<AlphaChannel>(v); });
+    each("pixelaspectratio",
+         [&](const Value& v) { out.mPixelAspectRatio = v.get<PixelAspectRatio>(); });
+    each("alphachanneltype",
+         [&](const Value& v) { out.mAlphaChannelType = ReadEnum<AlphaChannel>(v); });
     each("framesize", [&](const Value& v) { out.mFrameRect = v.get<RectT<int>>(); });
     // A missing rate reads as unset, the same as an object without "ticksperframe".
     each("framerate", [&](const Value& v) { out.mFrameRate = v.get<FrameRate>(); });
-    each("pixelformatlist", [&](const Value& v) { out.mPixelFormatList = ReadList<PixelFormat>(v); });
+    each("pixelformatlist",
+         [&](const Value& v) { out.mPixelFormatList = ReadList<PixelFormat>(v); });
     // Unlike its neighbours, a missing field type reads as 0 rather than the default.
     out.mFieldType = FieldType::Progressive;
     each("fieldtype", [&](const Value& v) { out.mFieldType = ReadEnum<FieldType>(v); });
@@ -274,7 +279,8 @@ void from_json(const Value& j, SourceInfo& r) {
         out.mAudioChannelLayout = ReadList<AudioChannelDescription>(v);
     });
     each("audiosamplerate", [&](const Value& v) { out.mAudioSampleRate = v.get<FrameRate>(); });
-    each("initialcontentstate", [&](const Value& v) { out.mInitialContentState = GuidFromWire(v); });
+    each("initialcontentstate",
+         [&](const Value& v) { out.mInitialContentState = GuidFromWire(v); });
     each("hasaudio", [&](const Value& v) { out.mHasAudio = ReadBool(v); });
     each("hasvideo", [&](const Value& v) { out.mHasVideo = ReadBool(v); });
     each("currenttime", [&](const Value& v) { out.mCurrentTime = RatioTimeFromValue(v); });
@@ -291,7 +297,8 @@ void from_json(const Value& j, SourceInfo& r) {
     each("ismedia", [&](const Value& v) { out.mIsMedia = ReadBool(v); });
     each("supportsvideorenderingsessions",
          [&](const Value& v) { out.mSupportsVideoRenderingSessions = ReadBool(v); });
-    each("appspecificsourceinfo", [&](const Value& v) { out.mAppSpecificSourceInfo = ReadString(v); });
+    each("appspecificsourceinfo",
+         [&](const Value& v) { out.mAppSpecificSourceInfo = ReadString(v); });
     each("capsuleparams", [&](const Value& v) { FromJSON(v, out.mCapsuleParams); });
     each("colorSpace", [&](const Value& v) { out.mColorSpace = v.get<ColorSpace>(); });
     each("hasFrozenUnstretchableRegions",

@@ -111,7 +111,9 @@ void SourceTextFontEditInfo::ExtractProperties(const Value& object) {
     SourceTextFontEditInfo out = *this;
     if (const Value* v = FindMember(object, "capPropFontEdit")) out.mFontEdit = ReadBool(*v);
     if (const Value* v = FindMember(object, "fontEditValue")) out.mFontName = ReadWString(*v);
-    if (const Value* v = FindMember(object, "capPropFontSizeEdit")) out.mFontSizeEdit = ReadBool(*v);
+    if (const Value* v = FindMember(object, "capPropFontSizeEdit")) {
+        out.mFontSizeEdit = ReadBool(*v);
+    }
     if (const Value* v = FindMember(object, "fontSizeEditValue")) out.mFontSize = ReadFloat(*v);
     if (const Value* v = FindMember(object, "capPropFontFauxStyleEdit")) {
         out.mFauxStyleEdit = ReadBool(*v);
@@ -204,7 +206,9 @@ void TextEditInfo::ExtractProperties(const Value& object) {
     }
     if (const Value* v = FindMember(object, "textEditValue")) out.mText = ReadWString(*v);
     if (const Value* v = FindMember(object, "capPropFontEdit")) out.mFontEdit = ReadBool(*v);
-    if (const Value* v = FindMember(object, "capPropFontSizeEdit")) out.mFontSizeEdit = ReadBool(*v);
+    if (const Value* v = FindMember(object, "capPropFontSizeEdit")) {
+        out.mFontSizeEdit = ReadBool(*v);
+    }
     if (const Value* v = FindMember(object, "capPropFontFauxStyleEdit")) {
         out.mFauxStyleEdit = ReadBool(*v);
     }
@@ -440,7 +444,9 @@ void to_json(Value& j, const SpreadsheetValue& v) {
 void from_json(const Value& j, SpreadsheetValue& v) {
     RequireObject(j);
     SpreadsheetValue out;
-    if (const Value* rows = FindMember(j, "activeRows")) out.mActiveRows = ReadInteger<uint32_t>(*rows);
+    if (const Value* rows = FindMember(j, "activeRows")) {
+        out.mActiveRows = ReadInteger<uint32_t>(*rows);
+    }
     if (const Value* columns = FindMember(j, "columnValues")) {
         RequireArray(*columns);
         out.mColumns.reserve(columns->size());

@@ -11,7 +11,9 @@ class RandomRecords {
 public:
     explicit RandomRecords(uint32_t seed) : mRng(seed) {}
 
-    int64_t Int(int64_t lo, int64_t hi) { return std::uniform_int_distribution<int64_t>(lo, hi)(mRng); }
+    int64_t Int(int64_t lo, int64_t hi) {
+        return std::uniform_int_distribution<int64_t>(lo, hi)(mRng);
+    }
     bool Bool() { return Int(0, 1) == 1; }
     double Double() { return std::uniform_real_distribution<double>(-1e6, 1e6)(mRng); }
     float Float() { return static_cast<float>(Double()); }
@@ -76,13 +78,17 @@ public:
             const bool anim = Bool();
             switch (Int(0, 11)) {
             case 0: p.AddTextParam(name, ui, anim, Wide(), TextEdit()); break;
-            case 1: p.AddFloatParam(name, ui, anim, Double(), Double(), Double(), int(Int(-9, 9))); break;
+            case 1:
+                p.AddFloatParam(name, ui, anim, Double(), Double(), Double(), int(Int(-9, 9)));
+                break;
             case 2: p.AddBooleanParam(name, ui, anim, Bool()); break;
             case 3: p.AddColorParam(name, ui, anim, {Float(), Float(), Float(), Float()}); break;
             case 4: p.AddCommentParam(name, ui, anim, Wide()); break;
             case 5: p.AddAngleParam(name, ui, anim, Double()); break;
             case 6: p.AddPoint2DParam(name, ui, anim, {Double(), Double()}); break;
-            case 7: p.AddScaleParam(name, ui, anim, {Double(), Double(), Double()}, Bool(), 3); break;
+            case 7:
+                p.AddScaleParam(name, ui, anim, {Double(), Double(), Double()}, Bool(), 3);
+                break;
             case 8: p.AddGroupParam(name, ui, anim, {Wide(), Wide()}, Bool()); break;
             case 9: {
                 std::vector<SpreadsheetColumnInfo> infos;
@@ -92,7 +98,9 @@ public:
                                       uint32_t(Int(0, UINT32_MAX)), infos);
                 break;
             }
-            case 10: p.AddMenuParam(name, ui, anim, int(Int(INT32_MIN, INT32_MAX)), {Wide()}); break;
+            case 10:
+                p.AddMenuParam(name, ui, anim, int(Int(INT32_MIN, INT32_MAX)), {Wide()});
+                break;
             default: {
                 MediaReplacementInfo m;
                 m.mVersion = uint32_t(Int(0, UINT32_MAX));
@@ -134,7 +142,8 @@ public:
         s.mFrameRect.mSize = {int(Int(0, 8192)), int(Int(0, 8192))};
         s.mFrameRate = FrameRate(Bool() ? FrameRate::kUnset : Int(INT64_MIN, INT64_MAX));
         for (int64_t i = Int(0, 4); i > 0; --i) {
-            s.mPixelFormatList.push_back({uint32_t(Int(0, UINT32_MAX)), uint32_t(Int(0, UINT32_MAX))});
+            s.mPixelFormatList.push_back(
+                {uint32_t(Int(0, UINT32_MAX)), uint32_t(Int(0, UINT32_MAX))});
         }
         s.mFieldType = FieldType(Int(INT32_MIN, INT32_MAX));
         s.mNativeFieldType = FieldType(Int(0, 4));

@@ -83,8 +83,8 @@ TEST(TextEditInfo, InsertSplitsAtTheSelectionAndMergesAlikeNeighbours) {
     t.InsertTextRun(MakeRun(0, u"ignored", true), 2, 6, TextEditInfo::kChangeBold);
     ASSERT_EQ(t.mRunCount, 4);
     ASSERT_EQ(t.mRuns.size(), 4u);
-    const TextRunFontEditInfo expected[] = {MakeRun(2, u"A"), MakeRun(2, u"A", true), MakeRun(2, u"B", true),
-                                            MakeRun(2, u"B")};
+    const TextRunFontEditInfo expected[] = {MakeRun(2, u"A"), MakeRun(2, u"A", true),
+                                            MakeRun(2, u"B", true), MakeRun(2, u"B")};
     for (size_t i = 0; i < 4; ++i) EXPECT_EQ(t.mRuns[i], expected[i]) << i;
     EXPECT_TRUE(t.Verify());
 
