@@ -360,10 +360,16 @@ void TextEditInfo::InsertTextRun(const TextRunFontEditInfo& run, int32_t start, 
         const int64_t runStart = offset;
         const int64_t runEnd = offset + r.mRunLength;
         offset = runEnd;
+        if (runStart >= start && runEnd <= end) {
+            // Wholly inside, including an empty run at the caret (the format of an empty text).
+            runs.push_back(r);
+            CopyChangeTypeSpecificValue(run, runs.back(), changeType);
+            continue;
+        }
         const int64_t innerStart = std::max<int64_t>(runStart, start);
         const int64_t innerEnd = std::min<int64_t>(runEnd, end);
         if (innerStart >= innerEnd) {
-            runs.push_back(r);  // outside the selection (or empty)
+            runs.push_back(r);  // outside the selection
             continue;
         }
         if (runStart < innerStart) {

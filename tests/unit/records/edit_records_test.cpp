@@ -99,6 +99,12 @@ TEST(TextEditInfo, InsertSplitsAtTheSelectionAndMergesAlikeNeighbours) {
     EXPECT_EQ(t.mRuns[0].mRunLength, 8);
     EXPECT_EQ(t.mRunCount, 1);
 
+    // An empty text keeps its format in one empty run; a change at the caret applies to it.
+    TextEditInfo empty(SourceTextFontEditInfo{});
+    empty.InsertTextRun(MakeRun(0, u"", true), 0, 0, TextEditInfo::kChangeBold);
+    ASSERT_EQ(empty.mRuns.size(), 1u);
+    EXPECT_TRUE(empty.mRuns[0].mBold);
+
     TextRunFontEditInfo to = MakeRun(1, u"A");
     TextEditInfo::CopyChangeTypeSpecificValue(
         TextRunFontEditInfo(9, u"X", 30.0f, true, true, true, true), to,
