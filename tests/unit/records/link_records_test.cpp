@@ -133,6 +133,8 @@ TEST(SourceInfo, RandomRecordsRoundTripThroughTheWireAndText) {
         const Value tree = s;
         ASSERT_EQ(ThroughWire(tree).get<SourceInfo>(), s) << ToJSONText(tree);
         ASSERT_EQ(ParseJSONText(ToJSONText(tree)).get<SourceInfo>(), s) << ToJSONText(tree);
+        const auto values = s.mCapsuleParams.GetParamValues();
+        ASSERT_EQ(ThroughWire(Value(*values)).get<CapsuleParamValues>(), *values);
     }
 }
 
