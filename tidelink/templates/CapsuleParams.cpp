@@ -21,14 +21,16 @@ void CapsuleParam::InitSharedProperties(const ImmutableString& matchName, const 
     mProperties[kCapsuleParamProperty_Animatable] = P(animatable);
 }
 
-#define TIDELINK_INIT_KIND(kind)                                 \
-    InitSharedProperties(matchName, uiName, animatable);         \
-    mProperties[kCapsuleParamProperty_Type] = P(kCapsuleParamType_##kind)
+void CapsuleParam::InitKind(CapsuleParamType type, const ImmutableString& matchName,
+                            const WString& uiName, bool animatable) {
+    InitSharedProperties(matchName, uiName, animatable);
+    mProperties[kCapsuleParamProperty_Type] = P(type);
+}
 
 void CapsuleParam::InitTextParam(const ImmutableString& matchName, const WString& uiName,
                                  bool animatable, const WString& defaultText,
                                  const TextEditInfo& textEditInfo) {
-    TIDELINK_INIT_KIND(Text);
+    InitKind(kCapsuleParamType_Text, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultText);
     mProperties[kCapsuleParamProperty_FontEditInfo] = P(textEditInfo);
 }
@@ -36,7 +38,7 @@ void CapsuleParam::InitTextParam(const ImmutableString& matchName, const WString
 void CapsuleParam::InitFloatParam(const ImmutableString& matchName, const WString& uiName,
                                   bool animatable, double defaultValue, double minValue,
                                   double maxValue, int decimals) {
-    TIDELINK_INIT_KIND(Float);
+    InitKind(kCapsuleParamType_Float, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultValue);
     mProperties[kCapsuleParamProperty_Min] = P(minValue);
     mProperties[kCapsuleParamProperty_Max] = P(maxValue);
@@ -45,38 +47,38 @@ void CapsuleParam::InitFloatParam(const ImmutableString& matchName, const WStrin
 
 void CapsuleParam::InitBooleanParam(const ImmutableString& matchName, const WString& uiName,
                                     bool animatable, bool defaultValue) {
-    TIDELINK_INIT_KIND(Boolean);
+    InitKind(kCapsuleParamType_Boolean, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultValue);
 }
 
 void CapsuleParam::InitColorParam(const ImmutableString& matchName, const WString& uiName,
                                   bool animatable, const ColorRGBA& defaultColor) {
-    TIDELINK_INIT_KIND(Color);
+    InitKind(kCapsuleParamType_Color, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultColor);
 }
 
 void CapsuleParam::InitCommentParam(const ImmutableString& matchName, const WString& uiName,
                                     bool animatable, const WString& text) {
-    TIDELINK_INIT_KIND(Comment);
+    InitKind(kCapsuleParamType_Comment, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(text);
 }
 
 void CapsuleParam::InitAngleParam(const ImmutableString& matchName, const WString& uiName,
                                   bool animatable, double defaultAngle) {
-    TIDELINK_INIT_KIND(Angle);
+    InitKind(kCapsuleParamType_Angle, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultAngle);
 }
 
 void CapsuleParam::InitPoint2DParam(const ImmutableString& matchName, const WString& uiName,
                                     bool animatable, const CapsulePoint& defaultPoint) {
-    TIDELINK_INIT_KIND(Point2D);
+    InitKind(kCapsuleParamType_Point2D, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultPoint);
 }
 
 void CapsuleParam::InitScaleParam(const ImmutableString& matchName, const WString& uiName,
                                   bool animatable, const std::vector<double>& defaultScale,
                                   bool linked, int dimensions) {
-    TIDELINK_INIT_KIND(Scale);
+    InitKind(kCapsuleParamType_Scale, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultScale);
     mProperties[kCapsuleParamProperty_Linked] = P(linked);
     mProperties[kCapsuleParamProperty_Dimensions] = P(dimensions);
@@ -85,7 +87,7 @@ void CapsuleParam::InitScaleParam(const ImmutableString& matchName, const WStrin
 void CapsuleParam::InitGroupParam(const ImmutableString& matchName, const WString& uiName,
                                   bool animatable, const std::vector<WString>& defaultValue,
                                   bool expanded) {
-    TIDELINK_INIT_KIND(Group);
+    InitKind(kCapsuleParamType_Group, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultValue);
     mProperties[kCapsuleParamProperty_Expanded] = P(expanded);
 }
@@ -94,7 +96,7 @@ void CapsuleParam::InitSpreadsheetParam(const ImmutableString& matchName, const 
                                         bool animatable, const SpreadsheetValue& defaultValue,
                                         unsigned int minRows, unsigned int maxRows,
                                         const std::vector<SpreadsheetColumnInfo>& columnInfos) {
-    TIDELINK_INIT_KIND(Spreadsheet);
+    InitKind(kCapsuleParamType_Spreadsheet, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultValue);
     mProperties[kCapsuleParamProperty_Min] = P(minRows);
     mProperties[kCapsuleParamProperty_Max] = P(maxRows);
@@ -104,7 +106,7 @@ void CapsuleParam::InitSpreadsheetParam(const ImmutableString& matchName, const 
 void CapsuleParam::InitMenuParam(const ImmutableString& matchName, const WString& uiName,
                                  bool animatable, int defaultIndex,
                                  const std::vector<WString>& menuEntries) {
-    TIDELINK_INIT_KIND(Menu);
+    InitKind(kCapsuleParamType_Menu, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultIndex);
     mProperties[kCapsuleParamProperty_MenuContent] = P(menuEntries);
 }
@@ -112,13 +114,11 @@ void CapsuleParam::InitMenuParam(const ImmutableString& matchName, const WString
 void CapsuleParam::InitMediaParam(const ImmutableString& matchName, const WString& uiName,
                                   bool animatable, bool expanded, const WString& defaultText,
                                   const MediaReplacementInfo& mediaReplacementInfo) {
-    TIDELINK_INIT_KIND(Media);
+    InitKind(kCapsuleParamType_Media, matchName, uiName, animatable);
     mProperties[kCapsuleParamProperty_Expanded] = P(expanded);
     mProperties[kCapsuleParamProperty_DefaultValue] = P(defaultText);
     mProperties[kCapsuleParamProperty_MediaReplacementInfo] = P(mediaReplacementInfo);
 }
-
-#undef TIDELINK_INIT_KIND
 
 const CapsuleParamProperty& CapsuleParam::At(CapsuleParamPropertyID id) const {
     auto it = mProperties.find(id);
@@ -616,12 +616,7 @@ void FromJSON(const Value& j, CapsuleParam& param) {
         break;
     }
     default:
-        out.InitSharedProperties(matchName, uiName, animatable);
-        out.SetProperties([&] {
-            auto props = out.GetProperties();
-            props[kCapsuleParamProperty_Type] = CapsuleParamProperty(type);
-            return props;
-        }());
+        out.InitKind(type, matchName, uiName, animatable);
         break;
     }
     param = std::move(out);

@@ -154,6 +154,11 @@ public:
     friend bool operator!=(const CapsuleParam& a, const CapsuleParam& b) { return !(a == b); }
 
 private:
+    friend TIDELINK_EXPORT void FromJSON(const Value& j, CapsuleParam& param);
+
+    // The shared properties and the type; a kind's initialiser adds its own properties.
+    void InitKind(CapsuleParamType type, const ImmutableString& matchName, const WString& uiName,
+                  bool animatable);
     const CapsuleParamProperty& At(CapsuleParamPropertyID id) const;
     template <class T>
     const T& Get(CapsuleParamPropertyID id) const;
