@@ -1,6 +1,9 @@
 #include "platform/Wire.h"
 
+#include <algorithm>
 #include <cstring>
+#include <string_view>
+#include <unordered_set>
 
 #include "platform/SerializationDetail.h"
 #include "platform/Strings.h"
@@ -99,7 +102,163 @@ void PutArgs(Buffer& out, const Value& args) {
     }
 }
 
+
+// Reads MessagePack straight into the tree. Recursion is bounded by the depth limit.
+class Reader {
+public:
+    Reader(const uint8_t* data, size_t size, size_t maxDepth)
+        : mPos(data), mEnd(data + size), mMaxDepth(maxDepth) {}
+
+    Value ReadTop() {
+        Value v = Read(0);
+        if (mPos != mEnd) throw WireError("undecodable message: trailing bytes");
+        return v;
+    }
+
+private:
+    [[noreturn]] static void Truncated() { throw WireError("undecodable message: truncated"); }
+    [[noreturn]] static void RepeatedKey() { throw WireError("undecodable message: repeated map key"); }
+
+    size_t Remaining() const { return static_cast<size_t>(mEnd - mPos); }
+
+    uint64_t Big(int bytes) {
+        if (Remaining() < static_cast<size_t>(bytes)) Truncated();
+        uint64_t v = 0;
+        for (int i = 0; i < bytes; ++i) v = (v << 8) | *mPos++;
+        return v;
+    }
+
+    std::string_view Bytes(size_t n) {
+        if (Remaining() < n) Truncated();
+        std::string_view view(reinterpret_cast<const char*>(mPos), n);
+        mPos += n;
+        return view;
+    }
+
+    Value Binary(size_t n, bool ext) {
+        const int64_t subtype = ext ? static_cast<int8_t>(Big(1)) : -1;
+        const auto bytes = Bytes(n);
+        Value::binary_t::container_type data(bytes.begin(), bytes.end());
+        return ext ? Value::binary(std::move(data), static_cast<std::uint8_t>(subtype)) : Value::binary(std::move(data));
+    }
+
+    Value Read(size_t depth) {
+        if (mPos == mEnd) Truncated();
+        const uint8_t b = *mPos++;
+        if (b <= 0x7f) return Value(static_cast<uint64_t>(b));
+        if (b >= 0xe0) return Value(static_cast<int64_t>(static_cast<int8_t>(b)));
+        if (b >= 0xa0 && b <= 0xbf) return Value(std::string(Bytes(b & 0x1f)));
+        if (b >= 0x90 && b <= 0x9f) return Array(b & 0x0f, depth);
+        if (b >= 0x80 && b <= 0x8f) return Map(b & 0x0f, depth);
+        switch (b) {
+            case 0xc0: return Value(nullptr);
+            case 0xc2: return Value(false);
+            case 0xc3: return Value(true);
+            case 0xcc: return Value(Big(1));
+            case 0xcd: return Value(Big(2));
+            case 0xce: return Value(Big(4));
+            case 0xcf: return Value(Big(8));
+            case 0xd0: return Value(static_cast<int64_t>(static_cast<int8_t>(Big(1))));
+            case 0xd1: return Value(static_cast<int64_t>(static_cast<int16_t>(Big(2))));
+            case 0xd2: return Value(static_cast<int64_t>(static_cast<int32_t>(Big(4))));
+            case 0xd3: return Value(static_cast<int64_t>(Big(8)));
+            case 0xca: {
+                const auto bits = static_cast<uint32_t>(Big(4));
+                float f;
+                std::memcpy(&f, &bits, sizeof(f));
+                return Value(static_cast<double>(f));
+            }
+            case 0xcb: {
+                const uint64_t bits = Big(8);
+                double d;
+                std::memcpy(&d, &bits, sizeof(d));
+                return Value(d);
+            }
+            case 0xd9: return Value(std::string(Bytes(Big(1))));
+            case 0xda: return Value(std::string(Bytes(Big(2))));
+            case 0xdb: return Value(std::string(Bytes(Big(4))));
+            case 0xc4: return Binary(Big(1), false);
+            case 0xc5: return Binary(Big(2), false);
+            case 0xc6: return Binary(Big(4), false);
+            case 0xd4: return Binary(1, true);
+            case 0xd5: return Binary(2, true);
+            case 0xd6: return Binary(4, true);
+            case 0xd7: return Binary(8, true);
+            case 0xd8: return Binary(16, true);
+            case 0xc7: return Binary(Big(1), true);
+            case 0xc8: return Binary(Big(2), true);
+            case 0xc9: return Binary(Big(4), true);
+            case 0xdc: return Array(Big(2), depth);
+            case 0xdd: return Array(Big(4), depth);
+            case 0xde: return Map(Big(2), depth);
+            case 0xdf: return Map(Big(4), depth);
+            default: throw WireError("undecodable message: reserved byte 0xc1");
+        }
+    }
+
+    void Enter(size_t depth) const {
+        if (depth + 1 > mMaxDepth) throw WireError("undecodable message: nested too deeply");
+    }
+
+    Value Array(uint64_t count, size_t depth) {
+        Enter(depth);
+        if (count > Remaining()) Truncated();  // every element takes at least one byte
+        Value v = Value::array();
+        auto& items = v.get_ref<Value::array_t&>();
+        items.reserve(static_cast<size_t>(count));
+        for (uint64_t i = 0; i < count; ++i) items.push_back(Read(depth + 1));
+        return v;
+    }
+
+    Value Map(uint64_t count, size_t depth) {
+        Enter(depth);
+        if (count > Remaining() / 2) Truncated();  // a key and a value, one byte each at least
+        Value v = Value::object();
+        auto& members = static_cast<std::vector<std::pair<const std::string, Value>>&>(
+            v.get_ref<Value::object_t&>());
+        members.reserve(static_cast<size_t>(count));
+        // Repeated keys are refused. Small maps sort their keys once at the end; large ones use a
+        // set, so a hostile map of millions of keys cannot make the check quadratic.
+        constexpr size_t kSmall = 64;
+        std::string_view small[kSmall];
+        std::unordered_set<std::string_view> seen;
+        const bool useSet = count > kSmall;
+        if (useSet) seen.reserve(static_cast<size_t>(count));
+        for (uint64_t i = 0; i < count; ++i) {
+            if (mPos == mEnd) Truncated();
+            const uint8_t b = *mPos++;
+            std::string_view key;
+            if (b >= 0xa0 && b <= 0xbf) key = Bytes(b & 0x1f);
+            else if (b == 0xd9) key = Bytes(Big(1));
+            else if (b == 0xda) key = Bytes(Big(2));
+            else if (b == 0xdb) key = Bytes(Big(4));
+            else throw WireError("undecodable message: map key is not a string");
+            if (useSet) {
+                if (!seen.insert(key).second) RepeatedKey();
+            } else {
+                small[i] = key;
+            }
+            members.emplace_back(std::string(key), Read(depth + 1));
+        }
+        if (!useSet && count > 1) {
+            std::sort(small, small + count);
+            if (std::adjacent_find(small, small + count) != small + count) RepeatedKey();
+        }
+        return v;
+    }
+
+    const uint8_t* mPos;
+    const uint8_t* mEnd;
+    size_t mMaxDepth;
+};
+
 }  // namespace
+
+void EncodeValue(Buffer& out, const Value& value) { Value::to_msgpack(value, out); }
+
+Value DecodeValue(const uint8_t* data, size_t size, size_t maxDepth) {
+    return Reader(data, size, maxDepth).ReadTop();
+}
 
 void AppendRequest(Buffer& out, uint64_t id, const std::string& name, const Value& args) {
     CheckName(name);
@@ -156,13 +315,7 @@ uint32_t ReadFrameLength(const uint8_t* p) {
 }
 
 Message DecodeBody(const uint8_t* data, size_t size) {
-    Value root;
-    try {
-        detail::DepthLimitedSax sax(root, kMaxValueDepth + 1);  // +1 for the envelope
-        Value::sax_parse(data, data + size, &sax, nlohmann::detail::input_format_t::msgpack, true);
-    } catch (const nlohmann::json::exception& e) {
-        throw WireError(std::string("undecodable message: ") + e.what());
-    }
+    Value root = DecodeValue(data, size, kMaxValueDepth + 1);  // +1 for the envelope
     if (!root.is_array() || root.empty() || !root[0].is_number_unsigned()) {
         throw WireError("message is not an envelope array");
     }

@@ -65,6 +65,13 @@ TIDELINK_EXPORT uint32_t ReadFrameLength(const uint8_t* data);
 // Decodes one frame body. Throws WireError naming what is wrong.
 TIDELINK_EXPORT Message DecodeBody(const uint8_t* data, size_t size);
 
+// One MessagePack value to and from the tree (the encoding of every argument and result).
+// DecodeValue reads exactly [data, data + size): nesting is limited to kMaxValueDepth, declared
+// counts are checked against the bytes that remain before anything is reserved, map keys must be
+// strings and must not repeat. Throws WireError.
+TIDELINK_EXPORT void EncodeValue(Buffer& out, const Value& value);
+TIDELINK_EXPORT Value DecodeValue(const uint8_t* data, size_t size, size_t maxDepth = kMaxValueDepth);
+
 TIDELINK_EXPORT Buffer MakeHello(const Secret& secret);
 // Checks a hello; returns Ok, VersionMismatch, or throws WireError for a bad magic or secret.
 TIDELINK_EXPORT HelloStatus CheckHello(const uint8_t* data, const Secret& secret);

@@ -1,3 +1,5 @@
+// The tests below replace the global allocator; gcc cannot see that new and free match here.
+#pragma GCC diagnostic ignored "-Wmismatched-new-delete"
 #include <gtest/gtest.h>
 
 #include <cstdint>
@@ -322,4 +324,32 @@ TEST(Wire, HelloAndAcknowledgement) {
     Buffer badAck = ok;
     badAck[3] = 0;
     EXPECT_THROW(ReadAck(badAck.data()), WireError);
+}
+
+// Maps with a repeated key are refused whatever their size, and a large hostile map is checked
+// without quadratic work (the test would time out otherwise).
+TEST(Wire, RepeatedMapKeysAreRefused) {
+    auto mapOf = [](size_t n, bool repeatLast) {
+        Buffer out;
+        out.push_back(0xdf);
+        for (int shift = 24; shift >= 0; shift -= 8) out.push_back(static_cast<uint8_t>(n >> shift));
+        for (size_t i = 0; i < n; ++i) {
+            const std::string key = "k" + std::to_string(repeatLast && i + 1 == n ? 0 : i);
+            out.push_back(static_cast<uint8_t>(0xa0 | key.size()));
+            out.insert(out.end(), key.begin(), key.end());
+            out.push_back(static_cast<uint8_t>(i & 0x7f));
+        }
+        return out;
+    };
+    for (size_t n : {2u, 17u, 64u, 65u, 200000u}) {
+        const Buffer ok = mapOf(n, false);
+        EXPECT_EQ(DecodeValue(ok.data(), ok.size()).size(), n);
+        const Buffer bad = mapOf(n, true);
+        EXPECT_THROW(DecodeValue(bad.data(), bad.size()), WireError) << n << " keys";
+    }
+    // Member order is kept as sent.
+    const Buffer ordered = mapOf(3, false);
+    const Value v = DecodeValue(ordered.data(), ordered.size());
+    EXPECT_EQ(v.begin().key(), "k0");
+    EXPECT_EQ((--v.end()).key(), "k2");
 }
