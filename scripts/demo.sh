@@ -4,6 +4,8 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/install-deps.sh
+# Let ccache share results between clones of the project.
+export CCACHE_BASEDIR="$PWD" CCACHE_NOHASHDIR=1
 if [ ! -x build/release/bin/tidelink ] || [ -n "$(find CMakeLists.txt apps platform tidelink -newer build/release/bin/tidelink -print -quit 2>/dev/null)" ]; then
   echo "== building (release)" >&2
   cmake --preset release >/dev/null

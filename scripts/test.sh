@@ -5,6 +5,8 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/install-deps.sh
+# Let ccache share results between clones of the project.
+export CCACHE_BASEDIR="$PWD" CCACHE_NOHASHDIR=1
 presets=("$@")
 [ ${#presets[@]} -eq 0 ] && presets=(debug)
 for preset in "${presets[@]}"; do
