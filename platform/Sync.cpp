@@ -4,6 +4,19 @@
 
 namespace tidelink::platform {
 
+namespace {
+thread_local bool tTransportThread = false;
+
+void WarnIfTransportThread(const char* what) {
+    if (tTransportThread) {
+        TL_TRACE("platform", 0) << what << " blocks a transport thread; replies on its sessions wait";
+    }
+}
+}  // namespace
+
+void MarkTransportThread() { tTransportThread = true; }
+bool IsTransportThread() { return tTransportThread; }
+
 void RecursiveMutex::Lock(const char* label, int timeoutMs) {
     const auto limit = std::chrono::milliseconds(timeoutMs > 0 ? timeoutMs : kDefaultLockTimeoutMs);
     const auto me = std::this_thread::get_id();
@@ -37,6 +50,7 @@ void RecursiveMutex::Unlock() {
 
 bool SyncPoint::Arrive(int timeoutMs) {
     std::unique_lock lock(mMutex);
+    if (mArrived + 1 < mParties) WarnIfTransportThread("SyncPoint::Arrive");
     if (++mArrived >= mParties) {
         mCond.notify_all();
         return true;
@@ -69,6 +83,7 @@ bool Gate::IsOpen() {
 
 bool Gate::Wait(int timeoutMs) {
     std::unique_lock lock(mMutex);
+    if (!mOpen) WarnIfTransportThread("Gate::Wait");
     if (timeoutMs < 0) {
         mCond.wait(lock, [this] { return mOpen; });
         return true;

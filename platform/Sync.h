@@ -20,6 +20,11 @@ namespace tidelink::platform {
 
 inline constexpr int kDefaultLockTimeoutMs = 60000;
 
+// Transport threads mark themselves; a blocking wait (SyncPoint, Gate) on one of them is a bug
+// that can stall every session of the transport, and is traced at level 0.
+TIDELINK_EXPORT void MarkTransportThread();
+TIDELINK_EXPORT bool IsTransportThread();
+
 class TIDELINK_EXPORT RecursiveMutex {
 public:
     void Lock(const char* label, int timeoutMs = kDefaultLockTimeoutMs);
