@@ -43,6 +43,19 @@ struct Pending {
     uint64_t correlate = 0;
 };
 
+// Outside code runs through here: an exception from a callback must neither skip the callbacks
+// after it nor end a session's read loop.
+template <class F, class... Args>
+void SafeCall(const char* what, const F& f, Args&&... args) {
+    try {
+        f(std::forward<Args>(args)...);
+    } catch (const std::exception& e) {
+        TL_TRACE(kCat, 0) << what << " threw: " << e.what();
+    } catch (...) {
+        TL_TRACE(kCat, 0) << what << " threw an unknown exception";
+    }
+}
+
 int32_t CodeFor(TransportError reason) {
     return reason == TransportError::Shutdown ? kErrorTransportShutdown : kErrorSessionClosed;
 }
@@ -185,10 +198,10 @@ public:
             const int32_t code = CodeFor(reason);
             const WString message = MessageFor(reason);
             for (const auto& [id, p] : pending) {
-                if (p.fail) p.fail(code, message, p.correlate ? p.correlate : id);
+                if (p.fail) SafeCall("A failure function", p.fail, code, message, p.correlate ? p.correlate : id);
             }
             SessionPtr handle = self->mHandle.lock();
-            for (const auto& [guid, h] : handlers) h(handle, reason);
+            for (const auto& [guid, h] : handlers) SafeCall("A close handler", h, handle, reason);
             if (self->mOnClosed) self->mOnClosed(self.get());
         });
     }
@@ -203,7 +216,7 @@ public:
             }
         }
         asio::post(mIo, [self = shared_from_this(), handler = std::move(handler)] {
-            handler(self->mHandle.lock(), TransportError::LocalClose);
+            SafeCall("A close handler", handler, self->mHandle.lock(), TransportError::LocalClose);
         });
         return id;
     }
@@ -328,7 +341,7 @@ private:
     void PostFailure(FailureFn fail, int32_t code, WString message, RequestId id) {
         if (!fail) return;
         asio::post(mIo, [fail = std::move(fail), code, message = std::move(message), id] {
-            fail(code, message, id);
+            SafeCall("A failure function", fail, code, message, id);
         });
     }
 
@@ -475,9 +488,9 @@ private:
             if (!p) return;  // cancelled, or a reply nobody asked for
             const RequestId reported = p->correlate ? p->correlate : m.id;
             if (m.isError) {
-                if (p->fail) p->fail(m.errorCode, ToUTF16(m.errorMessage), reported);
+                if (p->fail) SafeCall("A failure function", p->fail, m.errorCode, ToUTF16(m.errorMessage), reported);
             } else if (p->ok) {
-                p->ok(m.result, reported);
+                SafeCall("A success function", p->ok, m.result, reported);
             }
             return;
         }
@@ -492,9 +505,9 @@ private:
                 SendErrorReply(m.id, kErrorRequestRefused, "No handler for message \"" + m.name + "\"");
                 return;
             }
-            dispatcher->OnRequest(handle, m.id, m.name, m.args);
+            SafeCall("A request dispatcher", [&] { dispatcher->OnRequest(handle, m.id, m.name, m.args); });
         } else if (dispatcher && handle) {
-            dispatcher->OnNotification(handle, m.name, m.args);
+            SafeCall("A notification dispatcher", [&] { dispatcher->OnNotification(handle, m.name, m.args); });
         } else {
             TL_TRACE(kCat, 3) << "Notification " << m.name << " dropped: no handler";
         }
@@ -616,7 +629,7 @@ struct ListeningServer::Impl : std::enable_shared_from_this<ListeningServer::Imp
                 std::lock_guard lock(self->mutex);
                 h = self->sessionHandler;
             }
-            if (auto accepted = s->mHandle.lock(); h && accepted) h(accepted);
+            if (auto accepted = s->mHandle.lock(); h && accepted) SafeCall("A session handler", h, accepted);
         });
         Accept();
     }

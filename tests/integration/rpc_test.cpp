@@ -357,3 +357,33 @@ TEST(Transport, ClientStartGivesNullWhenNothingListens) {
 }
 
 }  // namespace
+
+namespace {
+
+// A callback that throws must not cost anyone else their callback, nor stop the session.
+TEST_F(RpcTest, ThrowingCallbacksHarmNobodyElse) {
+    std::atomic<int> later{0};
+    Gate thrown;
+    client->SendRequest(BuildCall("test.echo"), [&](const Value&, RequestId) {
+        thrown.Open();
+        throw std::runtime_error("caller bug");
+    }, nullptr);
+    ASSERT_TRUE(thrown.Wait(10000));
+    EXPECT_TRUE(Call("test.echo").first) << "the session still reads";
+
+    registrar->Register("test.never", std::make_shared<FunctionRequestHandler>(
+                                          [keep = std::make_shared<std::vector<ResponderPtr>>()](
+                                              const ResponderPtr& r, const Value&) { keep->push_back(r); }));
+    for (int i = 0; i < 3; ++i) {
+        client->SendRequest(BuildCall("test.never"), nullptr, [&](int32_t, const WString&, RequestId) {
+            ++later;
+            throw std::runtime_error("caller bug in a failure function");
+        });
+    }
+    session->AddCloseHandler([&](const SessionPtr&, TransportError) { ++later; });
+    ASSERT_TRUE(WaitFor([&] { return server->SessionCount() == 1; }, 5));
+    session->Close();
+    EXPECT_TRUE(WaitFor([&] { return later.load() == 4; }, 10));
+}
+
+}  // namespace
