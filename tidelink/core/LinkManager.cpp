@@ -246,48 +246,40 @@ uint16_t GetPortForTideLinkManager() {
     return s.managerPort;
 }
 
-ExecutorPtr GetSharedExecutor() {
-    auto& s = State();
-    RecursiveMutex::Guard lock(s.sharedLock, "GetSharedExecutor");
-    auto e = s.executor.lock();
-    if (!e) {
-        e = CreateSubExecutor(CreateCPUBoundExecutor(), -1);
-        s.executor = e;
+namespace {
+
+// Returns the object in |slot| while someone still holds it, otherwise a new one from |create|.
+template <class T, class F>
+std::shared_ptr<T> SharedObject(std::weak_ptr<T>& slot, const char* label, F create) {
+    RecursiveMutex::Guard lock(State().sharedLock, label);
+    auto object = slot.lock();
+    if (!object) {
+        object = create();
+        slot = object;
     }
-    return e;
+    return object;
+}
+
+}  // namespace
+
+ExecutorPtr GetSharedExecutor() {
+    return SharedObject(State().executor, "GetSharedExecutor",
+                        [] { return CreateSubExecutor(CreateCPUBoundExecutor(), -1); });
 }
 
 SocketTransportPtr GetSharedTransport() {
-    auto& s = State();
-    RecursiveMutex::Guard lock(s.sharedLock, "GetSharedTransport");
-    auto t = s.transport.lock();
-    if (!t) {
-        t = SocketTransport::Create(GetSharedExecutor());
-        s.transport = t;
-    }
-    return t;
+    return SharedObject(State().transport, "GetSharedTransport",
+                        [] { return SocketTransport::Create(GetSharedExecutor()); });
 }
 
 ListeningServerPtr GetSharedServer() {
-    auto& s = State();
-    RecursiveMutex::Guard lock(s.sharedLock, "GetSharedServer");
-    auto srv = s.server.lock();
-    if (!srv) {
-        srv = ServerStart(GetSharedTransport(), 0, true);
-        s.server = srv;
-    }
-    return srv;
+    return SharedObject(State().server, "GetSharedServer",
+                        [] { return ServerStart(GetSharedTransport(), 0, true); });
 }
 
 RPCServerPtr GetSharedRPCServer() {
-    auto& s = State();
-    RecursiveMutex::Guard lock(s.sharedLock, "GetSharedRPCServer");
-    auto r = s.rpcServer.lock();
-    if (!r) {
-        r = std::make_shared<RPCServer>(GetSharedServer(), "SharedServer");
-        s.rpcServer = r;
-    }
-    return r;
+    return SharedObject(State().rpcServer, "GetSharedRPCServer",
+                        [] { return std::make_shared<RPCServer>(GetSharedServer(), "SharedServer"); });
 }
 
 }  // namespace tidelink
