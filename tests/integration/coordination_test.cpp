@@ -294,3 +294,21 @@ TEST_F(CoordinationTest, ALostManagerCompletesEveryWaitWithNoAnswer) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST_F(CoordinationTest, StatusReportsTheBufferService) {
+    WritableBinaryReferencePtr w;
+    ASSERT_EQ(GetWritableBinaryData(123456, w), 0);
+    auto r = RunCommand(BinDir() + "/tidelink status --json");
+    ASSERT_EQ(r.exitCode, 0) << r.err;
+    const Value b = ParseJSONText(r.out).at("buffers");
+    EXPECT_EQ(b["buffers_live"], 1);
+    EXPECT_EQ(b["bytes_live"], 123456);
+    EXPECT_EQ(b["bytes_pooled"], 0);
+    EXPECT_EQ(b["clients"], 1) << "the status query itself holds nothing";
+    w.reset();
+    ASSERT_TRUE(WaitFor([] { return Buffers()["bytes_pooled"] == 123456; }, 10));
+}
+
+}  // namespace
