@@ -277,6 +277,7 @@ TEST_F(BufferServiceTest, ClientsCannotTouchWhatTheyDoNotHold) {
     EXPECT_NE(stranger->Request(kAllocateBinaryData, Value::array({"big"})).value("result", 0), 0);
 
     owner->Publish(a.filename, frame, false);
+    owner->Sync();  // the publication travels on another connection
     EXPECT_EQ(stranger->IfAvailable(frame).result, 0);
 }
 
