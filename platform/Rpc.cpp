@@ -71,6 +71,15 @@ void MessageHandler::HandleRequest(const ResponderPtr& responder, const Value&) 
 
 void MessageHandler::HandleNotification(const Value&) {}
 
+void MessageHandler::HandleRequestFrom(const SessionPtr&, const ResponderPtr& responder,
+                                       const Value& args) {
+    HandleRequest(responder, args);
+}
+
+void MessageHandler::HandleNotificationFrom(const SessionPtr&, const Value& args) {
+    HandleNotification(args);
+}
+
 // ---- registrar ----
 
 std::shared_ptr<MessageRegistrar> MessageRegistrar::Instance() {
@@ -114,7 +123,7 @@ void MessageRegistrar::OnRequest(const SessionPtr& session, RequestId id, const 
         return;
     }
     try {
-        handler->HandleRequest(responder, args);
+        handler->HandleRequestFrom(session, responder, args);
     } catch (const std::exception& e) {
         TL_TRACE("rpc", 1) << "Handler of \"" << name << "\" failed: " << e.what();
         responder->SendError(kErrorRequestRefused,
@@ -122,14 +131,15 @@ void MessageRegistrar::OnRequest(const SessionPtr& session, RequestId id, const 
     }
 }
 
-void MessageRegistrar::OnNotification(const SessionPtr&, const std::string& name, const Value& args) {
+void MessageRegistrar::OnNotification(const SessionPtr& session, const std::string& name,
+                                      const Value& args) {
     auto handler = Find(name);
     if (!handler) {
         TL_TRACE("rpc", 3) << "Notification for unknown message \"" << name << "\" dropped";
         return;
     }
     try {
-        handler->HandleNotification(args);
+        handler->HandleNotificationFrom(session, args);
     } catch (const std::exception& e) {
         TL_TRACE("rpc", 1) << "Handler of notification \"" << name << "\" failed: " << e.what();
     }

@@ -71,6 +71,11 @@ public:
     // handler is dropped.
     virtual void HandleRequest(const ResponderPtr& responder, const Value& args);
     virtual void HandleNotification(const Value& args);
+    // The same, told which session the message came on (a broker accounts per connection). By
+    // default they forward to the two above.
+    virtual void HandleRequestFrom(const SessionPtr& session, const ResponderPtr& responder,
+                                   const Value& args);
+    virtual void HandleNotificationFrom(const SessionPtr& session, const Value& args);
 };
 using MessageHandlerPtr = std::shared_ptr<MessageHandler>;
 
@@ -89,6 +94,32 @@ public:
     using Fn = std::function<void(const Value& args)>;
     explicit FunctionNotificationHandler(Fn fn) : mFn(std::move(fn)) {}
     void HandleNotification(const Value& args) override { mFn(args); }
+
+private:
+    Fn mFn;
+};
+
+// Handlers that need the session a message came on.
+class TIDELINK_EXPORT SessionRequestHandler : public MessageHandler {
+public:
+    using Fn = std::function<void(const SessionPtr&, const ResponderPtr&, const Value& args)>;
+    explicit SessionRequestHandler(Fn fn) : mFn(std::move(fn)) {}
+    void HandleRequestFrom(const SessionPtr& session, const ResponderPtr& responder,
+                           const Value& args) override {
+        mFn(session, responder, args);
+    }
+
+private:
+    Fn mFn;
+};
+
+class TIDELINK_EXPORT SessionNotificationHandler : public MessageHandler {
+public:
+    using Fn = std::function<void(const SessionPtr&, const Value& args)>;
+    explicit SessionNotificationHandler(Fn fn) : mFn(std::move(fn)) {}
+    void HandleNotificationFrom(const SessionPtr& session, const Value& args) override {
+        mFn(session, args);
+    }
 
 private:
     Fn mFn;

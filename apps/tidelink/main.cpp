@@ -87,6 +87,13 @@ int RunStatus(const std::string& format) {
         out["protocol_version"] = version;
         out["port"] = port;
         out["manager_pid"] = pid;
+        const Value b = v.value("buffers", Value::object());
+        Value buffers = Value::object();
+        buffers["buffers_live"] = b.value("buffers_live", uint64_t{0});
+        buffers["bytes_live"] = b.value("bytes_live", uint64_t{0});
+        buffers["bytes_pooled"] = b.value("bytes_pooled", uint64_t{0});
+        buffers["clients"] = b.value("clients", uint64_t{0});
+        out["buffers"] = buffers;
         std::cout << platform::ToJSONText(out, 4) << "\n";
     } else if (format == "compact") {
         std::cout << "status|protocol_version=" << version << "|port=" << port << "|manager_pid=" << pid << "\n";

@@ -38,6 +38,7 @@ public:
                 info["protocol_version"] = CSVersionPortNumberString();
                 info["sessions"] = self->SessionCount();
                 info["uptime_s"] = self->UptimeSeconds();
+                self->CollectInfo(info);
                 r->SendGeneralResult(info);
             }));
     }
@@ -167,6 +168,7 @@ void ManagerService::Stop() {
     // The mapping goes first, so no new client finds a manager that is going away.
     mPortFile.Close();
     if (mServer) mServer->Stop();
+    for (auto& m : mModules) m->OnStop();
     mRpcServer.reset();
     mServer.reset();
     mTransport.reset();
@@ -202,5 +204,9 @@ uint16_t ManagerService::Port() const { return mServer ? mServer->GetPort() : 0;
 size_t ManagerService::SessionCount() const { return mServer ? mServer->SessionCount() : 0; }
 
 double ManagerService::UptimeSeconds() const { return NowSeconds() - mStartTime; }
+
+void ManagerService::CollectInfo(Value& info) const {
+    for (const auto& m : mModules) m->AddInfo(info);
+}
 
 }  // namespace tidelink::manager

@@ -39,6 +39,10 @@ public:
     virtual void Register(ManagerService& service) = 0;
     // Called on a transport thread when a session of a client ends.
     virtual void OnSessionClosed(const platform::SessionPtr&) {}
+    // Adds the module's figures to the status query's answer.
+    virtual void AddInfo(platform::Value&) {}
+    // Called once when the service stops.
+    virtual void OnStop() {}
 };
 
 enum class StartResult { Started, AlreadyRunning, Failed };
@@ -64,6 +68,10 @@ public:
     size_t SessionCount() const;
     const platform::MessageRegistrarPtr& Registrar() const { return mRegistrar; }
     double UptimeSeconds() const;
+    // True when this service holds the per-user, per-version instance lock.
+    bool HoldsInstanceLock() const { return mLockFd >= 0; }
+    // Lets every module add its figures to |info|.
+    void CollectInfo(platform::Value& info) const;
 
 private:
     void SweepStalePortFiles();

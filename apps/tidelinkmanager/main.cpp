@@ -7,6 +7,7 @@
 #include <string>
 #include <thread>
 
+#include "BufferService.h"
 #include "ManagerService.h"
 #include "platform/Trace.h"
 #include "tidelink/core/LinkManager.h"
@@ -18,6 +19,8 @@ void Usage(FILE* out) {
                  "Usage: tidelinkmanager [--idle-exit SECONDS] [--version]\n"
                  "  --idle-exit SECONDS  exit after SECONDS without clients (default 300, 0 = never;\n"
                  "                       TIDELINK_MANAGER_IDLE_EXIT sets the default)\n"
+                 "  --buffer-client-cap BYTES  bytes one client may hold allocated and unpublished\n"
+                 "                       (default 1 GiB; TIDELINK_BUFFER_CLIENT_CAP sets the default)\n"
                  "Normally started by the tidelink library when a host needs it.\n");
 }
 
@@ -26,6 +29,7 @@ void Usage(FILE* out) {
 int main(int argc, char** argv) {
     using namespace tidelink;
     manager::ManagerOptions options;
+    manager::BufferServiceOptions bufferOptions = manager::BufferServiceOptionsFromEnvironment();
     if (const char* env = std::getenv("TIDELINK_MANAGER_IDLE_EXIT")) options.idleExitSeconds = std::atof(env);
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
@@ -34,6 +38,13 @@ int main(int argc, char** argv) {
             options.idleExitSeconds = std::strtod(argv[++i], &end);
             if (*end != '\0' || options.idleExitSeconds < 0) {
                 std::fprintf(stderr, "tidelinkmanager: bad --idle-exit value '%s'\n", argv[i]);
+                return 2;
+            }
+        } else if (arg == "--buffer-client-cap" && i + 1 < argc) {
+            char* end = nullptr;
+            bufferOptions.clientCapBytes = std::strtoull(argv[++i], &end, 10);
+            if (*end != '\0') {
+                std::fprintf(stderr, "tidelinkmanager: bad --buffer-client-cap value '%s'\n", argv[i]);
                 return 2;
             }
         } else if (arg == "--debug-publish-port" && i + 1 < argc) {
@@ -65,6 +76,7 @@ int main(int argc, char** argv) {
 
     auto service = std::make_shared<manager::ManagerService>(options);
     service->AddModule(manager::CreateCoreModule());
+    service->AddModule(std::make_shared<manager::BufferService>(bufferOptions));
     std::string error;
     switch (service->Start(error)) {
         case manager::StartResult::AlreadyRunning:
