@@ -170,12 +170,14 @@ public:
     void Disconnect(TransportError reason) {
         std::unordered_map<RequestId, Pending> pending;
         std::map<Guid, CloseHandler> handlers;
+        std::shared_ptr<MessageDispatcher> dispatcher;  // released here, breaking cycles through it
         {
             std::lock_guard lock(mMutex);
             if (mClosed) return;
             mClosed = true;
             pending.swap(mPending);
             handlers.swap(mCloseHandlers);
+            dispatcher.swap(mDispatcher);
             mAliases.clear();
         }
         {

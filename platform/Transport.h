@@ -114,7 +114,8 @@ public:
     void SendErrorReply(RequestId id, int32_t code, const std::string& message);
 
     // Where incoming requests and notifications go. Without a dispatcher requests are refused
-    // with -10004 and notifications are dropped.
+    // with -10004 and notifications are dropped. The session holds the dispatcher until it
+    // closes: a dispatcher that holds the session must hold it weakly.
     void SetDispatcher(std::shared_ptr<MessageDispatcher> dispatcher);
 
     SocketTransportPtr GetTransport() const;

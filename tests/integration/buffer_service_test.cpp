@@ -24,12 +24,24 @@ namespace {
 // One connection to the manager: sends requests and notifications and collects the data-arrived
 // notifications it receives.
 class Connection : public MessageDispatcher, public std::enable_shared_from_this<Connection> {
+    struct Forwarder : MessageDispatcher {
+        explicit Forwarder(const std::shared_ptr<Connection>& c) : target(c) {}
+        void OnRequest(const SessionPtr& s, RequestId id, const std::string& n, const Value& a) override {
+            if (auto t = target.lock()) t->OnRequest(s, id, n, a);
+        }
+        void OnNotification(const SessionPtr& s, const std::string& n, const Value& a) override {
+            if (auto t = target.lock()) t->OnNotification(s, n, a);
+        }
+        std::weak_ptr<Connection> target;
+    };
+
 public:
     static std::shared_ptr<Connection> Open() {
         auto c = std::make_shared<Connection>();
         c->mSession = GetSharedTransport()->ClientStart("127.0.0.1", GetPortForTideLinkManager());
         EXPECT_TRUE(c->mSession);
-        if (c->mSession) c->mSession->SetDispatcher(c);
+        // The session holds its dispatcher; a weak forwarder keeps it from holding us.
+        if (c->mSession) c->mSession->SetDispatcher(std::make_shared<Forwarder>(c));
         return c;
     }
     ~Connection() override { Close(); }
