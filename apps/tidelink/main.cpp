@@ -82,26 +82,33 @@ int RunStatus(const std::string& format) {
     const std::string version = v.value("protocol_version", platform::ToUTF8(GetTideLinkProtocolVersion()));
     const auto port = v.value("port", 0u);
     const auto pid = v.value("pid", 0u);
+    const Value b = v.value("buffers", Value::object());
+    const std::pair<const char*, uint64_t> buffers[] = {
+        {"buffers_live", b.value("buffers_live", uint64_t{0})},
+        {"bytes_live", b.value("bytes_live", uint64_t{0})},
+        {"bytes_pooled", b.value("bytes_pooled", uint64_t{0})},
+        {"clients", b.value("clients", uint64_t{0})}};
     if (format == "json") {
         Value out = Value::object();
         out["protocol_version"] = version;
         out["port"] = port;
         out["manager_pid"] = pid;
-        const Value b = v.value("buffers", Value::object());
-        Value buffers = Value::object();
-        buffers["buffers_live"] = b.value("buffers_live", uint64_t{0});
-        buffers["bytes_live"] = b.value("bytes_live", uint64_t{0});
-        buffers["bytes_pooled"] = b.value("bytes_pooled", uint64_t{0});
-        buffers["clients"] = b.value("clients", uint64_t{0});
-        out["buffers"] = buffers;
+        Value section = Value::object();
+        for (const auto& [key, value] : buffers) section[key] = value;
+        out["buffers"] = section;
         std::cout << platform::ToJSONText(out, 4) << "\n";
     } else if (format == "compact") {
         std::cout << "status|protocol_version=" << version << "|port=" << port << "|manager_pid=" << pid << "\n";
+        std::cout << "buffers";
+        for (const auto& [key, value] : buffers) std::cout << "|" << key << "=" << value;
+        std::cout << "\n";
     } else if (format == "flat") {
         std::cout << "status.protocol_version=\"" << version << "\"\nstatus.port=" << port
                   << "\nstatus.manager_pid=" << pid << "\n";
+        for (const auto& [key, value] : buffers) std::cout << "status.buffers." << key << "=" << value << "\n";
     } else {
         std::cout << "protocol_version=" << version << "\nport=" << port << "\nmanager_pid=" << pid << "\n";
+        for (const auto& [key, value] : buffers) std::cout << "buffers." << key << "=" << value << "\n";
     }
     return 0;
 }
