@@ -129,18 +129,23 @@ double MeasureFloor(uint64_t size, double seconds) {
     return frames / (now - start);
 }
 
-uint64_t ObjectsCreated(const RPCClientPtr& manager) {
-    Gate gate;
-    uint64_t n = 0;
+// The link manager's own description of itself ("value" of its info message).
+Value ManagerInfo(const RPCClientPtr& manager) {
+    auto gate = std::make_shared<Gate>();
+    auto info = std::make_shared<Value>(Value::object());
     manager->SendRequest(
         BuildCall(kManagerInfoMessage),
-        [&](const Value& reply, RequestId) {
-            n = reply.value("value", Value::object()).value("buffers", Value::object()).value("objects_created", 0ull);
-            gate.Open();
+        [gate, info](const Value& reply, RequestId) {
+            *info = reply.value("value", Value::object());
+            gate->Open();
         },
-        [&](int32_t, const WString&, RequestId) { gate.Open(); });
-    gate.Wait(10000);
-    return n;
+        [gate](int32_t, const WString&, RequestId) { gate->Open(); });
+    gate->Wait(10000);
+    return *info;
+}
+
+uint64_t ObjectsCreated(const RPCClientPtr& manager) {
+    return ManagerInfo(manager).value("buffers", Value::object()).value("objects_created", uint64_t{0});
 }
 
 class Consumer : public std::enable_shared_from_this<Consumer> {
@@ -336,16 +341,7 @@ int main(int argc, char** argv) {
     SleepMilliseconds(100);
     session->Close();
     if (privateManager) {
-        Gate gate;
-        uint32_t pid = 0;
-        manager->SendRequest(
-            BuildCall(kManagerInfoMessage),
-            [&](const Value& reply, RequestId) {
-                pid = reply.value("value", Value::object()).value("pid", 0u);
-                gate.Open();
-            },
-            [&](int32_t, const WString&, RequestId) { gate.Open(); });
-        gate.Wait(10000);
+        const auto pid = ManagerInfo(manager).value("pid", 0u);
         if (pid != 0) ::kill(static_cast<pid_t>(pid), SIGTERM);
     }
     UninitializeClient();
