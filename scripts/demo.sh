@@ -11,5 +11,7 @@ if [ ! -x build/release/bin/tidelink ] || [ -n "$(find CMakeLists.txt apps platf
   cmake --preset release >/dev/null
   cmake --build --preset release -j "$(nproc)"
 fi
+# A link manager this demo starts leaves by itself soon after the demo ends.
+export TIDELINK_MANAGER_IDLE_EXIT="${TIDELINK_MANAGER_IDLE_EXIT:-10}"
 echo "== tidelink status" >&2
 build/release/bin/tidelink status "$@"
