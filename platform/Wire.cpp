@@ -5,7 +5,6 @@
 #include <string_view>
 #include <unordered_set>
 
-#include "platform/SerializationDetail.h"
 #include "platform/Strings.h"
 
 namespace tidelink::platform::wire {
