@@ -283,30 +283,34 @@ public:
     }
 
     void SendReply(RequestId id, const Value& result) {
-        const bool batched = tReplyBatchOwner == this;
-        thread_local wire::Buffer scratch;
-        wire::Buffer& frame = batched ? mReplyBatch : scratch;
-        if (!batched) frame.clear();
         try {
-            wire::AppendReply(frame, id, result);
+            SendFrame([&](wire::Buffer& frame) { wire::AppendReply(frame, id, result); });
         } catch (const wire::WireError& e) {
             TL_TRACE(kCat, 1) << "Cannot send reply: " << e.what();
-            return SendErrorReply(id, kErrorRequestRefused, e.what());
-        }
-        if (!batched) {
-            Write(frame.data(), frame.size());
-        } else if (mReplyBatch.size() >= kMaxReplyBatch) {
-            FlushReplies();
+            SendErrorReply(id, kErrorRequestRefused, e.what());
         }
     }
 
     void SendErrorReply(RequestId id, int32_t code, const std::string& message) {
-        const bool batched = tReplyBatchOwner == this;
+        SendFrame([&](wire::Buffer& frame) {
+            wire::AppendErrorReply(frame, id, code, message.substr(0, 64 * 1024));
+        });
+    }
+
+    // Appends one reply frame: to the batch when this thread handles the session's batch (sent
+    // at its end, or now once the batch is large), otherwise straight to the socket. A failing
+    // append leaves the batch as it was.
+    template <class Append>
+    void SendFrame(const Append& append) {
+        if (tReplyBatchOwner == this) {
+            append(mReplyBatch);
+            if (mReplyBatch.size() >= kMaxReplyBatch) FlushReplies();
+            return;
+        }
         thread_local wire::Buffer scratch;
-        wire::Buffer& frame = batched ? mReplyBatch : scratch;
-        if (!batched) frame.clear();
-        wire::AppendErrorReply(frame, id, code, message.substr(0, 64 * 1024));
-        if (!batched) Write(frame.data(), frame.size());
+        scratch.clear();
+        append(scratch);
+        Write(scratch.data(), scratch.size());
     }
 
     void SetDispatcher(std::shared_ptr<MessageDispatcher> d) {
