@@ -9,7 +9,9 @@
 #include "platform/Rpc.h"
 #include "platform/Sync.h"
 #include "platform/Trace.h"
+#include "Host.h"
 #include "tidelink/core/LinkManager.h"
+#include "tidelink/peers/Project.h"
 
 namespace {
 
@@ -113,6 +115,33 @@ int RunStatus(const std::string& format) {
     return 0;
 }
 
+int RunOpen(const std::string& file, bool json, bool verbose) {
+    try {
+        cli::OpenOptions options;
+        options.verbose = verbose;
+        ProjectPtr project = cli::OpenProjectFile(file, options);
+        projectprotocol::ProjectInfo info;
+        info.mName = project->GetName();
+        info.mFile = project->GetFile();
+        info.mMissingAssets = project->GetMissingAssets();
+        info.mFarlandProductionInfo = project->GetFarlandProductionRequestInfo().GetProductionInfo();
+        if (json) {
+            std::cout << platform::ToJSONText(Value(info), 4) << "\n";
+            return 0;
+        }
+        std::cout << platform::ToUTF8(info.mName) << "\n  file: " << info.mFile.string() << "\n";
+        const auto& missing = info.mMissingAssets;
+        if (missing.IsEmpty()) std::cout << "  missing assets: none\n";
+        for (const auto& f : missing.mMissingFootage) std::cout << "  missing footage: " << platform::ToUTF8(f.mPath) << "\n";
+        for (const auto& f : missing.mMissingFonts) std::cout << "  missing font: " << f.mFullName << "\n";
+        for (const auto& p : missing.mMissingPlugins) std::cout << "  missing plug-in: " << p.mMatchName << "\n";
+        return 0;
+    } catch (const cli::HostError& e) {
+        PrintError(json ? "json" : "default", kExitFailure, e.message);
+        return kExitFailure;
+    }
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -132,6 +161,12 @@ int main(int argc, char** argv) {
     bool json = false;
     status->add_flag("--json", json, "Shorthand for --of json");
 
+    auto* open = app.add_subcommand("open", "Open a project in the application that serves it and describe it");
+    std::string projectFile;
+    open->add_option("project", projectFile, "Project file (.kstproj, .ospproj or .pufproj)")->required();
+    bool openJson = false;
+    open->add_flag("--json", openJson, "Print the project description as JSON");
+
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {
@@ -139,12 +174,14 @@ int main(int argc, char** argv) {
         return rc == 0 ? 0 : kExitUsage;
     }
     if (json) format = "json";
+    const int level = LevelForName(loglevel);
     if (std::getenv("TIDELINK_TRACE") == nullptr) {
-        const int level = LevelForName(loglevel);
         platform::SetTraceSelection(level < 0 ? "*:-1" : "*:" + std::to_string(level));
     }
+    cli::SetTraceLevel(level);
     platform::SetClientInfo(u"tidelink", platform::ToUTF16(TIDELINK_VERSION_STRING));
 
     if (status->parsed()) return RunStatus(format);
+    if (open->parsed()) return RunOpen(projectFile, openJson, level >= 3);
     return kExitUsage;
 }
