@@ -471,4 +471,12 @@ std::unique_ptr<ILocalServer> CreateLocalServer(ILocalServer::IAsyncCompletionCl
     return server;
 }
 
+bool DescribeWritableBinaryData(const WritableBinaryReferencePtr& reference, std::string& name, uint64_t& size) {
+    auto* local = dynamic_cast<LocalServer::WriteReference*>(reference.get());
+    if (!local || local->Name().empty()) return false;
+    name = local->Name();
+    size = local->GetSize();
+    return true;
+}
+
 }  // namespace processcoordination

@@ -102,6 +102,10 @@ TIDELINK_EXPORT tidelink::platform::ExecutorPtr GetDeliveryExecutor();
 TIDELINK_EXPORT int GetWritableBinaryData(uint64_t size, WritableBinaryReferencePtr& out);
 TIDELINK_EXPORT int PutCompletedBinaryData(const Guid& identifier, WritableBinaryReferencePtr reference,
                                            bool handOver);
+// The shared-memory name of writable data and its size (false for a reference made elsewhere or
+// already handed over): what a producer needs to be told to write into a buffer the caller owns.
+TIDELINK_EXPORT bool DescribeWritableBinaryData(const WritableBinaryReferencePtr& reference, std::string& name,
+                                                uint64_t& size);
 TIDELINK_EXPORT int PutBinaryDataGenerationError(const Guid& identifier, int error);
 TIDELINK_EXPORT int MakeBinaryDataAlias(const Guid& identifier, BinaryReferencePtr reference, const Guid& alias);
 TIDELINK_EXPORT int BeginBinaryDataGeneration(const Guid& identifier, bool flag);

@@ -6,6 +6,7 @@
 #include "tidelink/core/Brokering.h"
 #include "tidelink/core/LinkManager.h"
 #include "tidelink/peers/Project.h"
+#include "tidelink/peers/Source.h"
 
 namespace tidelink {
 
@@ -318,9 +319,29 @@ void Server::RuntimeFontChange(FontCallback callback) {
         [shared](int32_t, const WString&, RequestId) { (*shared)(ConnectionStatus::Failed, 0xFFFFFFFFu); });
 }
 
-void Server::OpenFarlandAsset(SourceCallback callback, const FarlandAssetRequestInfo&) {
+void Server::OpenFarlandAsset(SourceCallback callback, const FarlandAssetRequestInfo& request) {
     auto shared = std::make_shared<SourceCallback>(std::move(callback));
-    GetSharedExecutor()->Post([shared] { (*shared)(ConnectionStatus::Failed, nullptr); });
+    auto failed = [shared] { (*shared)(ConnectionStatus::Failed, nullptr); };
+    ObtainConnection(
+        Route::Farland, Value(request.GetAssetInfo()),
+        [shared, request, failed](const ServerReconnectPtr& link) {
+            link->SendDirectRequest(
+                BuildCall("com.quenlo.tidelink.OpenFarlandAsset", Value::array({Value(request)})),
+                [link, shared, failed](const Value& reply, RequestId) {
+                    SourceInfo info;
+                    try {
+                        info = ReplyValue<SourceInfo>(reply);
+                    } catch (const std::exception&) {
+                        return failed();
+                    }
+                    link->SetReconnectFarlandAsset(info.mFarlandAssetRequestInfo);
+                    auto source = Source::CreateFarlandSource(link, *shared);
+                    source->Init(info);
+                    (*shared)(ConnectionStatus::Connected, source);
+                },
+                [failed](int32_t, const WString&, RequestId) { failed(); });
+        },
+        failed);
 }
 
 }  // namespace tidelink

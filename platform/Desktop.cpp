@@ -1,0 +1,7 @@
+#include "platform/Desktop.h"
+
+namespace tidelink::platform {
+
+void AllowAnyProcessToTakeForeground() {}
+
+}  // namespace tidelink::platform
