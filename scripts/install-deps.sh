@@ -7,7 +7,7 @@ set -euo pipefail
 packages=(
   cmake ninja-build pkg-config ccache g++
   libboost1.74-dev libboost-thread1.74-dev libboost-system1.74-dev
-  nlohmann-json3-dev libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev
+  nlohmann-json3-dev libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev libpng-dev
 )
 for extra in "$@"; do
   case "$extra" in

@@ -9,6 +9,7 @@
 #include "platform/Rpc.h"
 #include "platform/Sync.h"
 #include "platform/Trace.h"
+#include "Commands.h"
 #include "Host.h"
 #include "tidelink/core/LinkManager.h"
 #include "tidelink/peers/Project.h"
@@ -167,6 +168,47 @@ int main(int argc, char** argv) {
     bool openJson = false;
     open->add_flag("--json", openJson, "Print the project description as JSON");
 
+    bool itemsJson = false, describeJson = false;
+    auto* items = app.add_subcommand("items", "List the bins and items of a project");
+    items->add_option("project", projectFile, "Project file")->required();
+    items->add_flag("--json", itemsJson, "Print the items as JSON");
+
+    std::string itemName;
+    auto* describe = app.add_subcommand("describe", "Describe an item of a project as a source");
+    describe->add_option("project", projectFile, "Project file")->required();
+    describe->add_option("item", itemName, "Item name, path (Bin/Item) or id")->required();
+    describe->add_flag("--json", describeJson, "Print the source description as JSON");
+
+    cli::RenderArgs renderArgs;
+    std::string frames, timeText, size;
+    bool sessions = false, noSessions = false;
+    auto* render = app.add_subcommand("render", "Render frames of an item to PNG files");
+    render->add_option("project", renderArgs.project, "Project file")->required();
+    render->add_option("item", renderArgs.item, "Item name, path (Bin/Item) or id")->required();
+    auto* framesOpt = render->add_option("--frames", frames, "Frame numbers A-B (or one number)");
+    auto* timeOpt = render->add_option("--time", timeText, "One frame at this time in seconds (1.5 or 1001/1000)");
+    framesOpt->excludes(timeOpt);
+    render->add_option("--size", size, "Output size WxH (default: the composition's)");
+    render->add_flag("--sessions", sessions, "Render through a rendering session");
+    render->add_flag("--no-sessions", noSessions, "Render without a rendering session")->excludes("--sessions");
+    render->add_option("-o,--output", renderArgs.output, "Output files, e.g. out/frame_%05d.png")->required();
+    render->add_option("-j,--jobs", renderArgs.depth, "Frames in flight (default 4)")->check(CLI::Range(1, 64));
+    render->add_option("--png-compression", renderArgs.compression, "zlib level 0-9 (default 1)")
+        ->check(CLI::Range(0, 9));
+
+    cli::AudioArgs audioArgs;
+    std::string startText = "0", durationText;
+    std::string sampleFormat = "f32";
+    auto* audio = app.add_subcommand("audio", "Render the audio of an item to a WAV file");
+    audio->add_option("project", audioArgs.project, "Project file")->required();
+    audio->add_option("item", audioArgs.item, "Item name, path (Bin/Item) or id")->required();
+    audio->add_option("--start", startText, "Start time in seconds (default 0)");
+    audio->add_option("--duration", durationText, "Duration in seconds")->required();
+    audio->add_option("-o,--output", audioArgs.output, "Output WAV file")->required();
+    audio->add_option("--sample-format", sampleFormat, "f32 (default) or s16")->check(CLI::IsMember({"f32", "s16"}));
+    audio->add_option("--chunk", audioArgs.samplesPerChunk, "Samples per chunk (default 4800)")
+        ->check(CLI::Range(1u, 1u << 20));
+
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {
@@ -183,5 +225,65 @@ int main(int argc, char** argv) {
 
     if (status->parsed()) return RunStatus(format);
     if (open->parsed()) return RunOpen(projectFile, openJson, level >= 3);
+    try {
+        if (items->parsed()) return cli::RunItems(projectFile, itemsJson);
+        if (describe->parsed()) return cli::RunDescribe(projectFile, itemName, describeJson);
+        if (render->parsed()) {
+            if (!frames.empty()) {
+                const auto dash = frames.find('-', 1);
+                try {
+                    renderArgs.first = std::stoll(frames.substr(0, dash));
+                    renderArgs.last = dash == std::string::npos ? renderArgs.first : std::stoll(frames.substr(dash + 1));
+                } catch (const std::exception&) {
+                    std::cerr << "tidelink: --frames takes A-B, e.g. 0-99\n";
+                    return kExitUsage;
+                }
+                if (renderArgs.first < 0 || renderArgs.last < renderArgs.first) {
+                    std::cerr << "tidelink: --frames A-B needs 0 <= A <= B\n";
+                    return kExitUsage;
+                }
+            } else if (!timeText.empty()) {
+                renderArgs.time = cli::ParseSeconds(timeText);
+                if (!renderArgs.time) {
+                    std::cerr << "tidelink: --time takes seconds, e.g. 1.5 or 1001/1000\n";
+                    return kExitUsage;
+                }
+            } else {
+                std::cerr << "tidelink: render needs --frames A-B or --time T\n";
+                return kExitUsage;
+            }
+            if (!size.empty()) {
+                const auto x = size.find('x');
+                try {
+                    renderArgs.width = std::stoi(size.substr(0, x));
+                    renderArgs.height = x == std::string::npos ? 0 : std::stoi(size.substr(x + 1));
+                } catch (const std::exception&) {
+                    renderArgs.width = 0;
+                }
+                if (renderArgs.width <= 0 || renderArgs.height <= 0 || renderArgs.width > 16384 || renderArgs.height > 16384) {
+                    std::cerr << "tidelink: --size takes WxH, e.g. 640x360\n";
+                    return kExitUsage;
+                }
+            }
+            if (sessions) renderArgs.sessions = true;
+            if (noSessions) renderArgs.sessions = false;
+            return cli::RunRender(renderArgs);
+        }
+        if (audio->parsed()) {
+            const auto start = cli::ParseSeconds(startText);
+            const auto duration = cli::ParseSeconds(durationText);
+            if (!start || !duration || *start < 0 || *duration <= 0) {
+                std::cerr << "tidelink: --start and --duration take seconds, e.g. 0 and 2.5\n";
+                return kExitUsage;
+            }
+            audioArgs.start = *start;
+            audioArgs.duration = *duration;
+            audioArgs.format = sampleFormat == "s16" ? cli::WavWriter::Format::Int16 : cli::WavWriter::Format::Float32;
+            return cli::RunAudio(audioArgs);
+        }
+    } catch (const cli::HostError& e) {
+        std::cerr << "tidelink: " << e.message << "\n";
+        return kExitFailure;
+    }
     return kExitUsage;
 }

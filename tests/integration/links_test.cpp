@@ -327,7 +327,7 @@ TEST(PeerLinks, ADirectServerSendsNothingToTheLinkManager) {
     EXPECT_EQ(RequestCount("CreateNamedServerLinkWithVersion"), 1);
 
     const Value before = ManagerInfo()["broker"]["requests"];
-    ProjectPtr project = Open(server, Example("catalog.plvcat"));
+    ProjectPtr project = Open(server, Example("library.plvcat"));
     ASSERT_TRUE(project);
     Result<uint32_t> font;
     server->RuntimeFontChange(font.Callback());
