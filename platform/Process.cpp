@@ -14,6 +14,9 @@
 #include <chrono>
 #include <climits>
 #include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <string_view>
 #include <thread>
 
 extern char** environ;
@@ -41,6 +44,33 @@ std::string GetCurrentModuleDir() {
 }
 
 pid_t LaunchProcess(const std::string& path, const std::vector<std::string>& args) {
+    return LaunchProcess(path, args, {});
+}
+
+pid_t LaunchProcess(const std::string& path, const std::vector<std::string>& args,
+                    const std::vector<std::string>& extraEnvironment) {
+    // The child's environment: the inherited one less the names |extraEnvironment| sets, then
+    // those entries.
+    std::vector<std::string> names;
+    for (const auto& entry : extraEnvironment) {
+        const size_t eq = entry.find('=');
+        if (eq == std::string::npos || eq == 0) {
+            errno = EINVAL;
+            return -1;
+        }
+        names.push_back(entry.substr(0, eq + 1));
+    }
+    std::vector<char*> envp;
+    for (char** e = environ; e != nullptr && *e != nullptr; ++e) {
+        const std::string_view entry(*e);
+        const bool replaced = std::any_of(names.begin(), names.end(), [&](const std::string& n) {
+            return entry.compare(0, n.size(), n) == 0;
+        });
+        if (!replaced) envp.push_back(*e);
+    }
+    for (const auto& entry : extraEnvironment) envp.push_back(const_cast<char*>(entry.c_str()));
+    envp.push_back(nullptr);
+
     posix_spawn_file_actions_t actions;
     posix_spawnattr_t attr;
     posix_spawn_file_actions_init(&actions);
@@ -72,7 +102,7 @@ pid_t LaunchProcess(const std::string& path, const std::vector<std::string>& arg
     argv.push_back(nullptr);
 
     pid_t pid = -1;
-    const int rc = ::posix_spawn(&pid, path.c_str(), &actions, &attr, argv.data(), environ);
+    const int rc = ::posix_spawn(&pid, path.c_str(), &actions, &attr, argv.data(), envp.data());
     posix_spawn_file_actions_destroy(&actions);
     posix_spawnattr_destroy(&attr);
     if (rc != 0) {
@@ -86,6 +116,15 @@ pid_t LaunchProcess(const std::string& path, const std::vector<std::string>& arg
         }
     }).detach();
     return pid;
+}
+
+std::string CheckExecutable(const std::string& path) {
+    struct stat st {};
+    if (::stat(path.c_str(), &st) != 0) return std::strerror(errno);
+    if (S_ISDIR(st.st_mode)) return std::strerror(EISDIR);
+    if (!S_ISREG(st.st_mode)) return "not a regular file";
+    if (::access(path.c_str(), X_OK) != 0) return std::strerror(errno);
+    return {};
 }
 
 std::vector<uint32_t> GetProcessIDsForName(const std::string& name) {
@@ -122,6 +161,37 @@ uint32_t GetCurrentProcessID() { return static_cast<uint32_t>(::getpid()); }
 bool IsProcessAlive(uint32_t pid) {
     if (pid == 0) return false;
     return ::kill(static_cast<pid_t>(pid), 0) == 0 || errno == EPERM;
+}
+
+bool IsProcessRunning(uint32_t pid) {
+    if (pid == 0) return false;
+    // The state follows the last ')' of /proc/<pid>/stat (the command name may hold one).
+    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+    std::string line;
+    if (!std::getline(in, line)) return false;
+    const size_t close = line.rfind(')');
+    if (close == std::string::npos || close + 2 >= line.size()) return false;
+    const char state = line[close + 2];
+    return state != 'Z' && state != 'X' && state != 'x';
+}
+
+bool SignalProcess(uint32_t pid, int signal) {
+    if (pid == 0 || pid > static_cast<uint32_t>(INT_MAX)) {
+        errno = EINVAL;
+        return false;
+    }
+    return ::kill(static_cast<pid_t>(pid), signal) == 0;
+}
+
+std::optional<std::string> GetProcessEnvironmentVariable(uint32_t pid, const std::string& name) {
+    if (pid == 0) return std::nullopt;
+    std::ifstream in("/proc/" + std::to_string(pid) + "/environ", std::ios::binary);
+    const std::string prefix = name + "=";
+    std::string entry;
+    while (std::getline(in, entry, '\0')) {
+        if (entry.compare(0, prefix.size(), prefix) == 0) return entry.substr(prefix.size());
+    }
+    return std::nullopt;
 }
 
 double NowSeconds() {

@@ -1,5 +1,6 @@
 #!/usr/bin/env bash
-# Fails when a link manager of this test run still runs, or when shared memory of it is left in
+# Fails when a process of this test run still runs (a link manager, or anything it or a test
+# started: peers inherit the run's TIDELINK_SUITE_VERSION), or when shared memory of it is left in
 # /dev/shm. Each integration test process records its suite version in the folder given as $1;
 # the records are consumed here.
 set -u
@@ -11,10 +12,10 @@ for f in "$records"/*; do versions+=("$(basename "$f")"); done
 for v in "${versions[@]}"; do
   for exe in /proc/[0-9]*/exe; do
     pid=${exe#/proc/}; pid=${pid%/exe}
+    [ "$pid" = "$$" ] && continue
     target=$(readlink "$exe" 2>/dev/null) || continue
-    case "${target% (deleted)}" in */tidelinkmanager) ;; *) continue ;; esac
     if tr '\0' '\n' < "/proc/$pid/environ" 2>/dev/null | grep -qx "TIDELINK_SUITE_VERSION=$v"; then
-      echo "left running: tidelinkmanager pid $pid (suite version $v)"
+      echo "left running: ${target##*/} pid $pid (suite version $v)"
       status=1
     fi
   done

@@ -91,6 +91,10 @@ int RunStatus(const std::string& format) {
         {"bytes_live", b.value("bytes_live", uint64_t{0})},
         {"bytes_pooled", b.value("bytes_pooled", uint64_t{0})},
         {"clients", b.value("clients", uint64_t{0})}};
+    // The broker: its full record in JSON, the number of peers and starts elsewhere.
+    const Value broker = v.value("broker", Value::object());
+    const std::pair<const char*, uint64_t> brokerFigures[] = {
+        {"peers", broker.value("peers", Value::array()).size()}, {"starts", broker.value("starts", uint64_t{0})}};
     if (format == "json") {
         Value out = Value::object();
         out["protocol_version"] = version;
@@ -99,19 +103,24 @@ int RunStatus(const std::string& format) {
         Value section = Value::object();
         for (const auto& [key, value] : buffers) section[key] = value;
         out["buffers"] = section;
+        out["broker"] = broker;
         std::cout << platform::ToJSONText(out, 4) << "\n";
     } else if (format == "compact") {
         std::cout << "status|protocol_version=" << version << "|port=" << port << "|manager_pid=" << pid << "\n";
         std::cout << "buffers";
         for (const auto& [key, value] : buffers) std::cout << "|" << key << "=" << value;
+        std::cout << "\nbroker";
+        for (const auto& [key, value] : brokerFigures) std::cout << "|" << key << "=" << value;
         std::cout << "\n";
     } else if (format == "flat") {
         std::cout << "status.protocol_version=\"" << version << "\"\nstatus.port=" << port
                   << "\nstatus.manager_pid=" << pid << "\n";
         for (const auto& [key, value] : buffers) std::cout << "status.buffers." << key << "=" << value << "\n";
+        for (const auto& [key, value] : brokerFigures) std::cout << "status.broker." << key << "=" << value << "\n";
     } else {
         std::cout << "protocol_version=" << version << "\nport=" << port << "\nmanager_pid=" << pid << "\n";
         for (const auto& [key, value] : buffers) std::cout << "buffers." << key << "=" << value << "\n";
+        for (const auto& [key, value] : brokerFigures) std::cout << "broker." << key << "=" << value << "\n";
     }
     return 0;
 }

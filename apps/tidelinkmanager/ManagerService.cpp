@@ -151,6 +151,7 @@ void ManagerService::OnSession(const SessionPtr& session) {
         {
             std::lock_guard lock(self->mMutex);
             self->mLastActivity = NowSeconds();
+            self->mBackground.erase(s.get());
         }
         for (auto& m : self->mModules) m->OnSessionClosed(s);
         self->mCond.notify_all();
@@ -182,7 +183,9 @@ bool ManagerService::WaitForExit(double pollSeconds) {
     std::unique_lock lock(mMutex);
     for (;;) {
         if (mStopRequested) return false;
-        if (mOptions.idleExitSeconds > 0 && mServer && mServer->SessionCount() == 0 &&
+        // Background sessions (peers' life lines) do not keep the service running.
+        const size_t sessions = mServer ? mServer->SessionCount() : 0;
+        if (mOptions.idleExitSeconds > 0 && mServer && sessions <= mBackground.size() &&
             NowSeconds() - mLastActivity >= mOptions.idleExitSeconds) {
             TL_TRACE(kCat, 3) << "No clients for " << mOptions.idleExitSeconds << " s; exiting";
             return true;
@@ -197,6 +200,25 @@ void ManagerService::RequestStop() {
         mStopRequested = true;
     }
     mCond.notify_all();
+}
+
+void ManagerService::MarkBackgroundSession(const SessionPtr& session) {
+    if (!session) return;
+    {
+        std::lock_guard lock(mMutex);
+        mBackground.insert(session.get());
+    }
+    // A session that closed meanwhile may have run its close handler before the insertion.
+    if (!session->IsOpen()) {
+        std::lock_guard lock(mMutex);
+        mBackground.erase(session.get());
+    }
+    mCond.notify_all();
+}
+
+size_t ManagerService::BackgroundSessionCount() const {
+    std::lock_guard lock(mMutex);
+    return mBackground.size();
 }
 
 uint16_t ManagerService::Port() const { return mServer ? mServer->GetPort() : 0; }

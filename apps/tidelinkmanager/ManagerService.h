@@ -10,6 +10,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -66,6 +67,11 @@ public:
 
     uint16_t Port() const;
     size_t SessionCount() const;
+    // Marks |session| as a background session (a peer's life line): while open it does not keep
+    // the service from idling out. Any thread; a session already closed is ignored.
+    void MarkBackgroundSession(const platform::SessionPtr& session);
+    // Open sessions marked as background.
+    size_t BackgroundSessionCount() const;
     const platform::MessageRegistrarPtr& Registrar() const { return mRegistrar; }
     double UptimeSeconds() const;
     // True when this service holds the per-user, per-version instance lock.
@@ -92,6 +98,7 @@ private:
     bool mStopRequested = false;
     bool mStopped = false;
     double mLastActivity = 0;
+    std::set<const platform::Session*> mBackground;  // open background sessions
 };
 
 // Answers the probe and the status query.

@@ -7,6 +7,7 @@
 #include <string>
 #include <thread>
 
+#include "BrokerService.h"
 #include "BufferService.h"
 #include "ManagerService.h"
 #include "platform/Trace.h"
@@ -21,6 +22,8 @@ void Usage(FILE* out) {
                  "                       TIDELINK_MANAGER_IDLE_EXIT sets the default)\n"
                  "  --buffer-client-cap BYTES  bytes one client may hold allocated and unpublished\n"
                  "                       (default 1 GiB; TIDELINK_BUFFER_CLIENT_CAP sets the default)\n"
+                 "Peer applications are found through their manifests: TIDELINK_PEERS_PATH, then\n"
+                 "../share/tidelink/peers and ../../share/tidelink/peers beside this program.\n"
                  "Normally started by the tidelink library when a host needs it.\n");
 }
 
@@ -77,6 +80,7 @@ int main(int argc, char** argv) {
     auto service = std::make_shared<manager::ManagerService>(options);
     service->AddModule(manager::CreateCoreModule());
     service->AddModule(std::make_shared<manager::BufferService>(bufferOptions));
+    service->AddModule(std::make_shared<manager::BrokerService>(manager::BrokerServiceOptionsFromEnvironment()));
     std::string error;
     switch (service->Start(error)) {
         case manager::StartResult::AlreadyRunning:
