@@ -2,6 +2,7 @@
 // or throw the documented errors (the serializer's exceptions, boost::bad_rational) and leave
 // its target alone; a record it returns must come back unchanged from a write and a read,
 // through the tree and the wire.
+// Project, item, address, render-option and caption records take the same path.
 // Text-edit records read from the input also go through the run-editing operations.
 #include <cstddef>
 #include <cstdint>
@@ -9,7 +10,11 @@
 #include <string_view>
 
 #include "platform/Serialization.h"
+#include "tidelink/core/Brokering.h"
 #include "tidelink/peers/LinkRecords.h"
+#include "tidelink/peers/ProjectProtocol.h"
+#include "tidelink/peers/Source.h"
+#include "tidelink/render/RenderOptions.h"
 #include "tidelink/templates/CapsuleParams.h"
 #include "tidelink/templates/EditRecords.h"
 
@@ -75,6 +80,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     Check<SpreadsheetValue>(v);
     Check<SpreadsheetColumnInfo>(v);
     Check<platform::ColorSpace>(v);
+    Check<projectprotocol::ProjectInfo>(v);
+    Check<MissingAssets>(v);
+    Check<ItemInfo>(v);
+    Check<ServerConnection>(v);
+    Check<VideoRenderOptions>(v);
+    Check<CaptionData>(v);
+    Check<CaptionSelectionData>(v);
     try {
         EditRuns(v.get<TextEditInfo>(), data, size);
     } catch (const nlohmann::json::exception&) {
