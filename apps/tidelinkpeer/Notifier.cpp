@@ -123,7 +123,8 @@ void EndpointNotifier::Close() {
         endpoints.swap(mEndpoints);
         mOnUnreachable = nullptr;
     }
-    for (auto& [key, ep] : endpoints) {
+    for (auto& entry : endpoints) {
+        const std::shared_ptr<Endpoint> ep = entry.second;
         ep->closed.store(true);
         ep->queue->Post([ep] {
             if (ep->session) ep->session->Close();
