@@ -50,7 +50,8 @@ struct Await {
     }
     T Get(double seconds = 60) {
         if (!gate->Wait(static_cast<int>(seconds * 1000)) || result->first != ConnectionStatus::Connected) return T{};
-        return result->second;
+        return std::move(result->second);  // a project keeps its open callback: do not keep the project here
+
     }
 };
 

@@ -41,7 +41,9 @@ public:
     std::optional<std::pair<ConnectionStatus, T>> Wait(double seconds) {
         if (!mState->gate.Wait(static_cast<int>(seconds * 1000))) return std::nullopt;
         std::lock_guard lock(mState->mutex);
-        return std::make_pair(mState->status, mState->value);
+        // Moved out: the callback may live as long as the object it delivered (a project keeps
+        // its open callback), and must not keep that object alive.
+        return std::make_pair(mState->status, std::move(mState->value));
     }
 
 private:

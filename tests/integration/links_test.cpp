@@ -65,6 +65,12 @@ struct Result {
         std::lock_guard lock(state->mutex);
         return state->value;
     }
+    // Moves the value out: a project's open callback lives as long as the project, so a result
+    // that kept the project would keep it alive for ever.
+    T Take() {
+        std::lock_guard lock(state->mutex);
+        return std::move(state->value);
+    }
     int Calls() {
         std::lock_guard lock(state->mutex);
         return state->calls;
@@ -125,7 +131,7 @@ ProjectPtr Open(const ServerPtr& server, const std::string& file) {
     server->OpenProject(r.Callback(), file);
     EXPECT_TRUE(r.Wait(60));
     EXPECT_EQ(r.Status(), ConnectionStatus::Connected) << file;
-    return r.Value();
+    return r.Take();
 }
 
 // Records what a connection's status callbacks saw.
@@ -193,8 +199,9 @@ TEST(PeerLinks, EveryBrokeredApplicationOpensItsProject) {
         std::mutex progressMutex;
         std::vector<std::pair<std::string, double>> progress;
         server->SetProgressCallback([&](const std::string& m, double f, const std::vector<WString>&) {
+            // The library's own steps; the peer's messages travel on another session.
             std::lock_guard lock(progressMutex);
-            progress.emplace_back(m, f);
+            if (m.rfind("$$$/tidelink/tidelink/", 0) == 0) progress.emplace_back(m, f);
         });
         ProjectPtr project = Open(server, c.file);
         ASSERT_TRUE(project);
@@ -225,7 +232,7 @@ TEST(PeerLinks, FailuresReachTheCallbackOnce) {
     std::mutex progressMutex;
     server->SetProgressCallback([&](const std::string& m, double f, const std::vector<WString>&) {
         std::lock_guard lock(progressMutex);
-        if (f == 0.0) progress.push_back(m);
+        if (m.rfind("$$$/tidelink/tidelink/OpenProjectFailed=", 0) == 0) progress.push_back(m);
     });
     for (const auto& file : {dir / "broken.kstproj", dir / "absent.kstproj"}) {
         Result<ProjectPtr> r;
@@ -238,8 +245,7 @@ TEST(PeerLinks, FailuresReachTheCallbackOnce) {
     }
     {
         std::lock_guard lock(progressMutex);
-        ASSERT_EQ(progress.size(), 2u);
-        EXPECT_NE(progress[0].find("OpenProjectFailed="), std::string::npos);
+        EXPECT_EQ(progress.size(), 2u);
     }
     // RuntimeFontChange on the server's own link: a brokered server has no direct session there.
     Result<uint32_t> font;
@@ -490,7 +496,7 @@ TEST(PeerReconnection, ObjectsGoneBeforeTheirRepliesAreLeftAlone) {
     server.reset();
     ASSERT_TRUE(opened.Wait(60));
     EXPECT_EQ(opened.Status(), ConnectionStatus::Connected);
-    ProjectPtr project = opened.Value();
+    ProjectPtr project = opened.Take();
     ASSERT_TRUE(project);
 
     // The project and its connection go while the reconnection chain waits for the link manager

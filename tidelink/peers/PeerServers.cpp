@@ -1,5 +1,6 @@
 #include "tidelink/peers/PeerServers.h"
 
+#include <atomic>
 #include <map>
 
 #include "platform/Config.h"
@@ -177,7 +178,8 @@ namespace {
 
 struct NamedRequests {
     std::mutex mutex;
-    std::map<int64_t, std::weak_ptr<RPCClient>> clients;
+    // The client a request went out on, held until the request ends so that it can be cancelled.
+    std::map<int64_t, std::shared_ptr<RPCClient>> clients;
 };
 
 NamedRequests& Named() {
@@ -205,39 +207,45 @@ int64_t CreateNamedServerConnection(const WString& serverName, const WString& se
     RPCClientPtr client = ReachLinkManager("tidelink::CreateNamedServerConnection");
     if (!client || !done) return 0;
     const std::string name = ToUTF8(serverName), path = ToUTF8(serverPath), instance = ToUTF8(instanceArgument);
+    // Set when the request has ended, so that an entry added after a quick answer is removed again.
+    auto ended = std::make_shared<std::atomic<bool>>(false);
     auto shared = std::make_shared<std::function<void(ServerConnection)>>(std::move(done));
-    auto ok = OKHandler<ServerConnection>(
-        [shared](ServerConnection connection) { (*shared)(std::move(connection)); },
-        [shared](int32_t, const WString&, RequestId) { (*shared)(ServerConnection{}); });
-    auto finish = [ok](const Value& reply, RequestId id) {
+    auto end = [ended, shared](RequestId id, ServerConnection connection) {
+        ended->store(true);
         ForgetNamed(static_cast<int64_t>(id));
-        ok(reply, id);
+        (*shared)(std::move(connection));
+    };
+    auto finish = [end](const Value& reply, RequestId id) {
+        ServerConnection connection;
+        try {
+            connection = ReplyValue<ServerConnection>(reply);
+        } catch (const nlohmann::json::exception& e) {
+            TL_TRACE(kCat, 2) << "Unreadable named server address: " << e.what();
+        }
+        end(id, std::move(connection));
     };
     std::weak_ptr<RPCClient> weakClient = client;
     const RequestId id = client->SendRequest(
         BuildCall(Message("CreateNamedServerLinkWithVersion"),
                   Value::array({name, path, instance, Value(ClientIdentity::Current())})),
         finish,
-        [weakClient, name, path, instance, finish, shared](int32_t, const WString&, RequestId failedId) {
+        [weakClient, name, path, instance, finish, end](int32_t, const WString&, RequestId failedId) {
             auto c = weakClient.lock();
-            if (!c) {
-                ForgetNamed(static_cast<int64_t>(failedId));
-                return (*shared)(ServerConnection{});
-            }
+            if (!c) return end(failedId, ServerConnection{});
             c->SendRequest(BuildCall(Message("CreateNamedServerLink"), Value::array({name, path, instance})), finish,
-                           [shared](int32_t code, const WString& message, RequestId lastId) {
+                           [end](int32_t code, const WString& message, RequestId lastId) {
                                TL_TRACE(kCat, 3) << "Named server request failed (" << code
                                                  << "): " << ToUTF8(message);
-                               ForgetNamed(static_cast<int64_t>(lastId));
                                // Port 0: the caller learns that no server could be had.
-                               (*shared)(ServerConnection{});
+                               end(lastId, ServerConnection{});
                            },
                            failedId);
         });
     {
         std::lock_guard lock(Named().mutex);
-        Named().clients[static_cast<int64_t>(id)] = client;
+        if (!ended->load()) Named().clients[static_cast<int64_t>(id)] = client;
     }
+    if (ended->load()) ForgetNamed(static_cast<int64_t>(id));
     return static_cast<int64_t>(id);
 }
 
@@ -247,7 +255,7 @@ void CancelNamedServerConnection(int64_t requestId) {
         std::lock_guard lock(Named().mutex);
         auto it = Named().clients.find(requestId);
         if (it == Named().clients.end()) return;
-        client = it->second.lock();
+        client = it->second;
         Named().clients.erase(it);
     }
     if (client) client->CancelRequest(static_cast<RequestId>(requestId), true);
