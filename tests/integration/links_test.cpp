@@ -115,7 +115,7 @@ KestrelServerPtr ConnectKestrel(ServerConnectionType type = ServerConnectionType
     KestrelServer::CreateTideLinkServer(r.Callback(), type);
     EXPECT_TRUE(r.Wait());
     EXPECT_EQ(r.Status(), ConnectionStatus::Connected);
-    return r.Value();
+    return r.Take();
 }
 
 ServerPtr Link(const GenericServerPtr& generic, ServerConnectionType type = kCreationConnectionType) {
@@ -123,7 +123,7 @@ ServerPtr Link(const GenericServerPtr& generic, ServerConnectionType type = kCre
     generic->CreateLink(r.Callback(), type);
     EXPECT_TRUE(r.Wait());
     EXPECT_EQ(r.Status(), ConnectionStatus::Connected);
-    return r.Value();
+    return r.Take();  // a server keeps its creation callback
 }
 
 ProjectPtr Open(const ServerPtr& server, const std::string& file) {
@@ -189,7 +189,7 @@ TEST(PeerLinks, EveryBrokeredApplicationOpensItsProject) {
         c.connect(described.Callback());
         ASSERT_TRUE(described.Wait());
         ASSERT_EQ(described.Status(), ConnectionStatus::Connected);
-        GenericServerPtr generic = described.Value();
+        GenericServerPtr generic = described.Take();
         EXPECT_EQ(generic->GetName(), c.name);
         SourceTypes types;
         generic->GetSourceTypes(types);
@@ -264,6 +264,8 @@ TEST(PeerLinks, ARefusedVersionedConnectFallsBackExactlyOnce) {
                                        << R"(/tidelinkpeer", "arguments": ["--role", "kestrel"], "legacyOnly": true,
         "description": {"servername": "Old Kestrel", "serverapiversion": 1, "serverappversion": "0.9",
                         "sourcetypes": {"Kestrel Project": ".kstproj"}}})";
+    // The manager reads the variable from the environment it starts with.
+    StopOurManagers();
     ::setenv("TIDELINK_PEERS_PATH", dir.c_str(), 1);
     KestrelServerPtr kestrel = ConnectKestrel();
     ASSERT_TRUE(kestrel);
@@ -328,7 +330,7 @@ TEST(PeerLinks, ADirectServerSendsNothingToTheLinkManager) {
     described.Value()->CreateLink(linked.Callback());
     ASSERT_TRUE(linked.Wait());
     ASSERT_EQ(linked.Status(), ConnectionStatus::Connected);
-    ServerPtr server = linked.Value();
+    ServerPtr server = linked.Take();
     EXPECT_TRUE(server->IsDirect());
     EXPECT_EQ(RequestCount("CreateNamedServerLinkWithVersion"), 1);
 

@@ -206,9 +206,8 @@ void Server::RegisterProgress(const ServerReconnectPtr& link) {
 
 // ---- operations ------------------------------------------------------------------------
 
-void Server::SendProjectRequest(const ServerReconnectPtr& link, Call call, ProjectCallback callback,
-                                bool reportConnecting, FarlandServerConnectInfo connectInfo) {
-    std::weak_ptr<Server> weak = mWeakSelf;
+void Server::SendProjectRequest(const std::weak_ptr<Server>& weak, const ServerReconnectPtr& link, Call call,
+                                ProjectCallback callback, bool reportConnecting, FarlandServerConnectInfo connectInfo) {
     if (reportConnecting) Report(weak, kConnectingToProject, -1.0);
     auto shared = std::make_shared<ProjectCallback>(std::move(callback));
     auto fail = [weak, shared](int32_t code, const WString& message, RequestId) {
@@ -253,9 +252,7 @@ void Server::OpenProject(ProjectCallback callback, const File& file) {
     ObtainConnection(
         Route::CreateLink, file.string(),
         [weak, shared, file](const ServerReconnectPtr& link) {
-            auto self = weak.lock();
-            if (!self) return (*shared)(ConnectionStatus::Failed, nullptr);
-            self->SendProjectRequest(link, BuildCall("com.quenlo.tidelink.OpenProject", Value::array({file.string()})),
+            SendProjectRequest(weak, link, BuildCall("com.quenlo.tidelink.OpenProject", Value::array({file.string()})),
                                      *shared, true, {});
         },
         [shared] { (*shared)(ConnectionStatus::Failed, nullptr); });
@@ -268,10 +265,8 @@ void Server::OpenProjectWithJSON(ProjectCallback callback, const File& file, con
     ObtainConnection(
         Route::CreateLink, file.string(),
         [weak, shared, file, json](const ServerReconnectPtr& link) {
-            auto self = weak.lock();
-            if (!self) return (*shared)(ConnectionStatus::Failed, nullptr);
-            self->SendProjectRequest(
-                link, BuildCall("com.quenlo.tidelink.OpenProjectWithJSON", Value::array({file.string(), json})),
+            SendProjectRequest(
+                weak, link, BuildCall("com.quenlo.tidelink.OpenProjectWithJSON", Value::array({file.string(), json})),
                 *shared, true, {});
         },
         [shared] { (*shared)(ConnectionStatus::Failed, nullptr); });
@@ -283,9 +278,7 @@ void Server::CreateProject(ProjectCallback callback, const File& directory, cons
     ObtainConnection(
         Route::Headed, Value(),
         [weak, shared, directory, projectName](const ServerReconnectPtr& link) {
-            auto self = weak.lock();
-            if (!self) return (*shared)(ConnectionStatus::Failed, nullptr);
-            self->SendProjectRequest(link,
+            SendProjectRequest(weak, link,
                                      BuildCall("com.quenlo.tidelink.CreateProject",
                                                Value::array({directory.string(), ToUTF8(projectName)})),
                                      *shared, false, {});
@@ -299,9 +292,7 @@ void Server::GetOpenProject(ProjectCallback callback, const FarlandProductionReq
     ObtainConnection(
         Route::HeadedUnlessDirect, Value(),
         [weak, shared, request](const ServerReconnectPtr& link) {
-            auto self = weak.lock();
-            if (!self) return (*shared)(ConnectionStatus::Failed, nullptr);
-            self->SendProjectRequest(link,
+            SendProjectRequest(weak, link,
                                      BuildCall("com.quenlo.tidelink.GetOpenProject", Value::array({Value(request)})),
                                      *shared, false, request.mServerConnectInfo);
         },

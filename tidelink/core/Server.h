@@ -119,8 +119,10 @@ private:
     static void Report(const std::weak_ptr<Server>& weak, const char* message, double fraction,
                        std::vector<WString> args = {});
     // The continuation shared by the operations that answer with a project.
-    void SendProjectRequest(const ServerReconnectPtr& link, platform::Call call, ProjectCallback callback,
-                            bool reportConnecting, FarlandServerConnectInfo connectInfo);
+    // Runs whether or not the server is still there; only progress needs it.
+    static void SendProjectRequest(const std::weak_ptr<Server>& weak, const ServerReconnectPtr& link,
+                                   platform::Call call, ProjectCallback callback, bool reportConnecting,
+                                   FarlandServerConnectInfo connectInfo);
     platform::Value Endpoint() const;
 
     ServerReconnectPtr mLink;
