@@ -176,10 +176,17 @@ void PuffinServer::CreateTideLinkServer(std::function<void(ConnectionStatus, Puf
 
 namespace {
 
+// A named-server request in flight: the client it went out on (held so that it can be cancelled)
+// and whether it was cancelled (its answer may already be on its way).
+struct NamedRequest {
+    std::shared_ptr<RPCClient> client;
+    std::atomic<bool> cancelled{false};
+    std::atomic<bool> ended{false};
+};
+
 struct NamedRequests {
     std::mutex mutex;
-    // The client a request went out on, held until the request ends so that it can be cancelled.
-    std::map<int64_t, std::shared_ptr<RPCClient>> clients;
+    std::map<int64_t, std::shared_ptr<NamedRequest>> requests;
 };
 
 NamedRequests& Named() {
@@ -189,7 +196,7 @@ NamedRequests& Named() {
 
 void ForgetNamed(int64_t id) {
     std::lock_guard lock(Named().mutex);
-    Named().clients.erase(id);
+    Named().requests.erase(id);
 }
 
 std::mutex gPloverPathMutex;
@@ -207,13 +214,13 @@ int64_t CreateNamedServerConnection(const WString& serverName, const WString& se
     RPCClientPtr client = ReachLinkManager("tidelink::CreateNamedServerConnection");
     if (!client || !done) return 0;
     const std::string name = ToUTF8(serverName), path = ToUTF8(serverPath), instance = ToUTF8(instanceArgument);
-    // Set when the request has ended, so that an entry added after a quick answer is removed again.
-    auto ended = std::make_shared<std::atomic<bool>>(false);
+    auto request = std::make_shared<NamedRequest>();
+    request->client = client;
     auto shared = std::make_shared<std::function<void(ServerConnection)>>(std::move(done));
-    auto end = [ended, shared](RequestId id, ServerConnection connection) {
-        ended->store(true);
+    auto end = [request, shared](RequestId id, ServerConnection connection) {
+        request->ended = true;
         ForgetNamed(static_cast<int64_t>(id));
-        (*shared)(std::move(connection));
+        if (!request->cancelled) (*shared)(std::move(connection));
     };
     auto finish = [end](const Value& reply, RequestId id) {
         ServerConnection connection;
@@ -229,9 +236,9 @@ int64_t CreateNamedServerConnection(const WString& serverName, const WString& se
         BuildCall(Message("CreateNamedServerLinkWithVersion"),
                   Value::array({name, path, instance, Value(ClientIdentity::Current())})),
         finish,
-        [weakClient, name, path, instance, finish, end](int32_t, const WString&, RequestId failedId) {
+        [weakClient, request, name, path, instance, finish, end](int32_t, const WString&, RequestId failedId) {
             auto c = weakClient.lock();
-            if (!c) return end(failedId, ServerConnection{});
+            if (!c || request->cancelled) return end(failedId, ServerConnection{});
             c->SendRequest(BuildCall(Message("CreateNamedServerLink"), Value::array({name, path, instance})), finish,
                            [end](int32_t code, const WString& message, RequestId lastId) {
                                TL_TRACE(kCat, 3) << "Named server request failed (" << code
@@ -243,22 +250,24 @@ int64_t CreateNamedServerConnection(const WString& serverName, const WString& se
         });
     {
         std::lock_guard lock(Named().mutex);
-        if (!ended->load()) Named().clients[static_cast<int64_t>(id)] = client;
+        // An answer that came before this line has nothing left to forget.
+        if (!request->ended) Named().requests[static_cast<int64_t>(id)] = request;
     }
-    if (ended->load()) ForgetNamed(static_cast<int64_t>(id));
+    if (request->ended) ForgetNamed(static_cast<int64_t>(id));
     return static_cast<int64_t>(id);
 }
 
 void CancelNamedServerConnection(int64_t requestId) {
-    std::shared_ptr<RPCClient> client;
+    std::shared_ptr<NamedRequest> request;
     {
         std::lock_guard lock(Named().mutex);
-        auto it = Named().clients.find(requestId);
-        if (it == Named().clients.end()) return;
-        client = it->second;
-        Named().clients.erase(it);
+        auto it = Named().requests.find(requestId);
+        if (it == Named().requests.end()) return;
+        request = it->second;
+        Named().requests.erase(it);
     }
-    if (client) client->CancelRequest(static_cast<RequestId>(requestId), true);
+    request->cancelled = true;
+    request->client->CancelRequest(static_cast<RequestId>(requestId), true);
 }
 
 // ---- PloverServer ----------------------------------------------------------------------------
