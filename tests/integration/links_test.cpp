@@ -361,8 +361,17 @@ TEST(PeerLinks, ADirectServerSendsNothingToTheLinkManager) {
 }
 
 TEST(PeerLinks, CancelledNamedServerRequestsStaySilent) {
+    // A named server that never announces itself: its answer (a failed start) comes only after
+    // the start limit, long after the cancel.
+    const auto dir = std::filesystem::temp_directory_path() / ("tl-named-" + std::to_string(::getpid()));
+    std::filesystem::create_directories(dir);
+    const auto script = dir / "silent-server";
+    std::ofstream(script) << "#!/bin/sh\nexec sleep 30\n";
+    std::filesystem::permissions(script, std::filesystem::perms::owner_all);
+    StopOurManagers();
+    ::setenv("TIDELINK_PEER_START_TIMEOUT", "1", 1);
     std::atomic<int> calls{0};
-    const int64_t id = CreateNamedServerConnection(u"Plover", ToUTF16(BinDir() + "/tidelinkpeer"), u"m7",
+    const int64_t id = CreateNamedServerConnection(u"Silent", ToUTF16(script.string()), u"m7",
                                                    [&](ServerConnection) { ++calls; });
     ASSERT_NE(id, 0);
     CancelNamedServerConnection(id);
@@ -374,8 +383,12 @@ TEST(PeerLinks, CancelledNamedServerRequestsStaySilent) {
               0);
     ASSERT_TRUE(bad.Wait());
     EXPECT_EQ(bad.Value().mPort, 0);
-    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    // Past the start limit: the cancelled request's answer has come and gone.
+    std::this_thread::sleep_for(std::chrono::milliseconds(1500));
     EXPECT_EQ(calls.load(), 0);
+    ::unsetenv("TIDELINK_PEER_START_TIMEOUT");
+    StopOurManagers();
+    std::filesystem::remove_all(dir);
 }
 
 // The heart of it: the peer dies with requests queued; they arrive, in order, at the new peer.
