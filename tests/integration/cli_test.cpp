@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <fstream>
 
 #include "Harness.h"
 #include "platform/Serialization.h"
@@ -58,3 +59,44 @@ TEST_F(CliTest, FailuresAndUsageErrorsUseTheirExitCodes) {
 }
 
 }  // namespace
+
+namespace {
+
+std::string ExampleProject(const std::string& name) {
+    return std::string(TIDELINK_SOURCE_DIR) + "/examples/projects/" + name;
+}
+
+}  // namespace
+
+TEST_F(CliTest, OpenDescribesAProjectOrSaysWhyNot) {
+    auto r = RunCommand(Tool() + " open " + ExampleProject("missing-footage.kstproj") + " --json");
+    ASSERT_EQ(r.exitCode, 0) << r.err;
+    const auto json = platform::ParseJSONText(r.out);
+    EXPECT_EQ(json["file"], ExampleProject("missing-footage.kstproj"));
+    EXPECT_FALSE(json["missing"]["missAssetsPropMissingFootage"].empty());
+
+    auto plain = RunCommand(Tool() + " open " + ExampleProject("titles.ospproj"));
+    ASSERT_EQ(plain.exitCode, 0) << plain.err;
+    EXPECT_NE(plain.out.find("missing assets: none"), std::string::npos);
+
+    // Not a project type any application serves, a file that is not there, a file the peer
+    // cannot read: exit 1 with the reason.
+    const auto dir = std::filesystem::temp_directory_path() / ("tl-cli-" + std::to_string(::getpid()));
+    std::filesystem::create_directories(dir);
+    std::ofstream(dir / "notes.txt") << "hello";
+    std::ofstream(dir / "broken.kstproj") << "{\"format\": \"tidelink-project\", \"version\": 1, \"items\": 7}";
+    auto wrongType = RunCommand(Tool() + " open " + (dir / "notes.txt").string());
+    EXPECT_EQ(wrongType.exitCode, 1);
+    EXPECT_NE(wrongType.err.find("Unknown project type"), std::string::npos) << wrongType.err;
+    auto absent = RunCommand(Tool() + " open " + (dir / "absent.kstproj").string());
+    EXPECT_EQ(absent.exitCode, 1);
+    EXPECT_NE(absent.err.find("No such project file"), std::string::npos) << absent.err;
+    auto broken = RunCommand(Tool() + " open " + (dir / "broken.kstproj").string() + " --json");
+    EXPECT_EQ(broken.exitCode, 1);
+    EXPECT_NE(broken.err.find("could not be opened: "), std::string::npos) << broken.err;
+    EXPECT_NE(broken.err.find("items"), std::string::npos) << "the peer's reason reaches the user: " << broken.err;
+    EXPECT_TRUE(platform::ParseJSONText(broken.out).contains("error"));
+    auto usage = RunCommand(Tool() + " open");
+    EXPECT_EQ(usage.exitCode, 2);
+    std::filesystem::remove_all(dir);
+}
