@@ -19,6 +19,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/Config.h"
 #include "platform/Process.h"
 #include "platform/Rpc.h"
 #include "platform/Sync.h"
