@@ -49,6 +49,11 @@ bool PeerRuntime::Start(std::string& error) {
         if (auto service = weakService.lock()) service->ForgetEndpoint(endpoint);
     });
     mService->Register(mRegistrar);
+    mProjects = ProjectServer::Create(mService, mRegistrar);
+    // Frames are drawn on every core, several at once, on threads of their own: drawing waits for
+    // the link manager's buffers, and the extra threads draw meanwhile.
+    mRenders = RenderService::Create(mService, CreateWorkerPool(HardwareThreadCount() + 2));
+    mRenders->Register(mRegistrar);
     mRpcServer = std::make_shared<RPCServer>(mServer, "TideLinkPeer", mRegistrar);
     TL_TRACE(kCat, 3) << mOptions.role.serverName << " serving on " << mAddress << ":" << mPort;
     if (mOptions.announce && !Announce(error)) return false;
@@ -151,6 +156,11 @@ void PeerRuntime::Stop() {
     if (!mStarted) return;
     // No new requests; the sessions of hosts close.
     if (mServer) mServer->Stop();
+    if (mRenders) {
+        mRenders->Unregister(mRegistrar);
+        mRenders->Shutdown();
+    }
+    if (mProjects) mProjects->Stop();
     if (mService) {
         mService->Unregister(mRegistrar);
         mService->Shutdown(mOptions.shutdownFlushMs);
@@ -164,6 +174,8 @@ void PeerRuntime::Stop() {
     }
     mRpcServer.reset();
     mServer.reset();
+    mRenders.reset();
+    mProjects.reset();
     mService.reset();
     mNotifier.reset();
     mTransport.reset();
