@@ -692,10 +692,10 @@ ItemsDocument ReadItemsXml(std::string_view text) {
     return doc;
 }
 
-Composition ReadCompositionXml(std::string_view text, const Composition& base, std::string* name) {
+std::optional<Composition> ReadCompositionXml(std::string_view text, const Composition& base, std::string* name) {
     const XmlElement root = ParseXml(text);
     const XmlElement* e = FirstComposition(root);
-    if (!e) throw ItemsXmlError("the text holds no <composition>");
+    if (!e) return std::nullopt;
     Attributes a(*e);
     Composition c = base;
     if (const std::string* n = a.Find("name"); n && name) *name = *n;

@@ -19,6 +19,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <string_view>
@@ -72,10 +73,11 @@ std::string WriteItemsXml(const ProjectModel& model, const std::vector<const Ite
 // ItemsXmlError.
 ItemsDocument ReadItemsXml(std::string_view text);
 
-// Reads the first <composition> of |text> (the root element itself, or the first one in document
+// Reads the first <composition> of |text| (the root element itself, or the first one in document
 // order) over |base|: the attributes it gives replace base's, its layers (when it has any)
-// replace base's layers. Sets |name| to its "name" when it has one. The result is not checked
-// (ValidateComposition). Throws ItemsXmlError.
-Composition ReadCompositionXml(std::string_view text, const Composition& base, std::string* name);
+// replace base's layers. Sets |name| to its "name" when it has one. Nothing when the text holds
+// no <composition> (XML of another dialect). The result is not checked (ValidateComposition).
+// Throws ItemsXmlError for text that is not XML or a <composition> that cannot be read.
+std::optional<Composition> ReadCompositionXml(std::string_view text, const Composition& base, std::string* name);
 
 }  // namespace tidelink::peer

@@ -258,13 +258,14 @@ void ProjectServer::CreateSourceFromXML(const ResponderPtr& responder, const Fil
                                         const SourceInfo& info, const FarlandProductionInfo& production) {
     Answer("CreateSourceFromXML", responder, [this, project, xml, info, production] {
         if (!production.IsEmpty() || !info.mFarlandProductionRequestInfo.IsEmpty()) throw ProjectError(kNoFarland);
-        Composition base;
-        base.channels = CreateStereoChannelLayout();
+        // The XML's composition (in our dialect) over the requested format; XML that holds none
+        // (another application's) leaves the source as CreateSource makes it.
         std::string name = ToUTF8(info.mName);
         Composition comp;
         try {
-            ApplySourceInfo(info, base);
-            comp = ReadCompositionXml(xml, base, &name);
+            const Composition requested = CompositionFromSourceInfo(info, false);
+            const auto described = ReadCompositionXml(xml, requested, &name);
+            comp = described ? *described : CompositionFromSourceInfo(info);
             ValidateComposition(comp);
         } catch (const ProjectError& e) {
             throw ProjectError(std::string("Cannot create the source: ") + e.what());

@@ -181,13 +181,13 @@ void ValidateComposition(const Composition& c) {
     }
 }
 
-Composition CompositionFromSourceInfo(const SourceInfo& info) {
-    if (info.mFrameRect.mSize.mX <= 0 || info.mFrameRect.mSize.mY <= 0) {
+Composition CompositionFromSourceInfo(const SourceInfo& info, bool strict) {
+    if (strict && (info.mFrameRect.mSize.mX <= 0 || info.mFrameRect.mSize.mY <= 0)) {
         Refuse("the frame rectangle has no size (" + std::to_string(info.mFrameRect.mSize.mX) + "x" +
                std::to_string(info.mFrameRect.mSize.mY) + ")");
     }
-    if (!info.mFrameRate.IsSet()) Refuse("the frame rate is not set");
-    if (info.mDuration <= 0) Refuse("the duration is not positive");
+    if (strict && !info.mFrameRate.IsSet()) Refuse("the frame rate is not set");
+    if (strict && info.mDuration <= 0) Refuse("the duration is not positive");
     Composition c;
     c.channels = platform::CreateStereoChannelLayout();
     ApplySourceInfo(info, c);
@@ -199,7 +199,7 @@ Composition CompositionFromSourceInfo(const SourceInfo& info) {
     tone.name = "1 kHz";
     tone.content = ToneLayer{1000.0, std::pow(10.0, -20.0 / 20.0), {}};
     c.layers.push_back(tone);
-    ValidateComposition(c);
+    if (strict) ValidateComposition(c);
     return c;
 }
 

@@ -19,8 +19,9 @@ SourceInfo DescribeSource(const ProjectModel& model, const Item& item, const std
 // The composition a host asks for with CreateSource: size from the frame rectangle, rate,
 // duration, pixel aspect ratio and audio format from |info| (size, rate and duration are
 // required; audio defaults to 48 kHz stereo); the test pattern, and a 1 kHz tone at -20 dBFS on
-// every channel. Throws ProjectError naming what is missing or out of range.
-Composition CompositionFromSourceInfo(const SourceInfo& info);
+// every channel. Throws ProjectError naming what is missing or out of range. With |strict| false
+// nothing is required or checked: what |info| leaves unset keeps the defaults of Composition.
+Composition CompositionFromSourceInfo(const SourceInfo& info, bool strict = true);
 
 // Overwrites the members of |comp| that |info| sets: a frame rectangle with a size, a set frame
 // rate, a positive duration, a pixel aspect ratio without zeros, a set audio rate, a non-empty

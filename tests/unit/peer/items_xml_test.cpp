@@ -185,14 +185,14 @@ TEST(ItemsXmlTest, CompositionOverABaseKeepsWhatTheTextLeavesOut) {
     base.channels = platform::CreateStereoChannelLayout();
     base.layers.push_back(Layer{"p", Rational(0), std::nullopt, PatternLayer{}});
     std::string name;
-    Composition c = ReadCompositionXml("<composition name=\"N\" width=\"320\" duration=\"5/2\"/>", base, &name);
+    Composition c = *ReadCompositionXml("<composition name=\"N\" width=\"320\" duration=\"5/2\"/>", base, &name);
     EXPECT_EQ(name, "N");
     EXPECT_EQ(c.width, 320);
     EXPECT_EQ(c.height, 360);
     EXPECT_EQ(c.frameRate, Rational(50));
     EXPECT_EQ(c.duration, Rational(5, 2));
     ASSERT_EQ(c.layers.size(), 1u);  // no layers given: the base's stay
-    c = ReadCompositionXml(
+    c = *ReadCompositionXml(
         "<tidelink-items><bin name=\"b\"><composition background=\"#102030\"><solid color=\"#ff0000\" "
         "rect=\"0 0 10 10\"/><tone level=\"-6\" frequency=\"100\"/></composition></bin></tidelink-items>",
         base, &name);
@@ -200,7 +200,10 @@ TEST(ItemsXmlTest, CompositionOverABaseKeepsWhatTheTextLeavesOut) {
     EXPECT_EQ(c.background, (Color8{0x10, 0x20, 0x30, 255}));
     ASSERT_EQ(c.layers.size(), 2u);
     EXPECT_NEAR(std::get<ToneLayer>(c.layers[1].content).amplitude, 0.5012, 1e-4);
-    EXPECT_THROW(ReadCompositionXml("<tidelink-items/>", base, &name), ItemsXmlError);
+    // Another application's XML holds no composition of ours; text that is not XML is refused.
+    EXPECT_FALSE(ReadCompositionXml("<items><clip/></items>", base, &name).has_value());
+    EXPECT_THROW(ReadCompositionXml("<items>", base, &name), ItemsXmlError);
+    EXPECT_THROW(ReadCompositionXml("<composition width=\"0\"/>", base, &name), ItemsXmlError);
 }
 
 // ---- adding items to a project ----
