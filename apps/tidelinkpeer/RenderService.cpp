@@ -97,22 +97,6 @@ std::pair<std::shared_ptr<const ProjectModel>, const Item*> FindComposition(Peer
     return {std::move(model), item};
 }
 
-// Maps a writable buffer for the duration of a scope.
-class Mapping {
-public:
-    explicit Mapping(const pc::WritableBinaryReferencePtr& ref) : mRef(ref), mData(ref->MapIntoCurrentProcess()) {}
-    ~Mapping() {
-        if (mData) mRef->UnmapFromCurrentProcess(mData);
-    }
-    Mapping(const Mapping&) = delete;
-    Mapping& operator=(const Mapping&) = delete;
-    uint8_t* Data() const { return static_cast<uint8_t*>(mData); }
-
-private:
-    pc::WritableBinaryReferencePtr mRef;
-    void* mData;
-};
-
 std::vector<float>& AudioScratch(size_t floats) {
     thread_local std::vector<float> scratch;
     if (scratch.size() < floats) scratch.resize(floats);
@@ -129,7 +113,8 @@ std::shared_ptr<RenderService> RenderService::Create(std::shared_ptr<PeerService
 }
 
 RenderService::RenderService(std::shared_ptr<PeerService> service, ExecutorPtr renderExecutor, Limits limits)
-    : mService(std::move(service)), mRender(std::move(renderExecutor)), mLimits(limits) {}
+    : mService(std::move(service)), mRender(std::move(renderExecutor)), mLimits(limits),
+      mMappings(limits.keptMappings, limits.keptMappingBytes) {}
 
 RenderService::~RenderService() = default;
 
@@ -176,6 +161,7 @@ void RenderService::Shutdown() {
         if (auto session = owner.session.lock()) session->RemoveCloseHandler(owner.closeHandler);
     }
     mRender->WaitUntilIdle();
+    mMappings.Clear();
     std::lock_guard lock(mCoordinationMutex);
     if (mCoordination.exchange(false)) pc::UninitializeClient();
 }
@@ -531,12 +517,23 @@ void RenderService::RunVideo(const std::shared_ptr<Job>& job, const VideoWork& w
                 throw RenderError("The link manager gave no buffer of " + std::to_string(bytes) + " bytes (" +
                                   std::to_string(got) + ")");
             }
-            {
-                Mapping map(ref);
-                if (!map.Data()) throw RenderError("Cannot map the frame's buffer");
-                WriteFrameHeader(map.Data(), header);
-                ComposeFrame(comp, work.time, g, map.Data() + kFrameHeaderBytes, g.RowBytes());
+            // Drawn through a mapping of our own kept between frames (the buffers come round again).
+            std::string name;
+            uint64_t size = 0;
+            if (!pc::DescribeWritableBinaryData(ref, name, size) || size < bytes) {
+                throw RenderError("The link manager's buffer cannot be described");
             }
+            auto mapping = mMappings.Take(name, size);
+            if (!mapping) throw RenderError("Cannot map the frame's buffer " + name);
+            auto* data = static_cast<uint8_t*>(mapping->GetAddress());
+            WriteFrameHeader(data, header);
+            try {
+                ComposeFrame(comp, work.time, g, data + kFrameHeaderBytes, g.RowBytes());
+            } catch (...) {
+                mMappings.Give(std::move(mapping));
+                throw;
+            }
+            mMappings.Give(std::move(mapping));
             if (job->cancelled) throw Cancelled{};
             const int published = pc::PutCompletedBinaryData(job->frame, ref, true);
             if (published != 0) throw RenderError("The frame could not be published (" + std::to_string(published) + ")");

@@ -27,6 +27,7 @@
 #include <string>
 #include <vector>
 
+#include "BufferMappings.h"
 #include "PeerService.h"
 #include "RenderRules.h"
 #include "platform/Executor.h"
@@ -40,6 +41,8 @@ public:
         size_t sessions = 4096;        // video and audio sessions each
         size_t framesInFlight = 1024;  // frames and chunks queued or being drawn
         size_t rememberedCancels = 1024;  // cancels of frames not (yet) asked for
+        size_t keptMappings = 16;      // buffer mappings kept between frames
+        uint64_t keptMappingBytes = uint64_t{512} << 20;
     };
 
     // |renderExecutor| draws frames (several at once); |service| has the open projects.
@@ -70,6 +73,7 @@ public:
     size_t VideoSessionCount() const;
     size_t AudioSessionCount() const;
     size_t FramesInFlight() const;
+    const BufferMappings& Mappings() const { return mMappings; }
     // Waits until every posted frame is done (tests).
     void WaitUntilIdle();
 
@@ -144,6 +148,7 @@ private:
     std::atomic<bool> mStopping{false};
     std::atomic<bool> mCoordination{false};
     std::mutex mCoordinationMutex;
+    BufferMappings mMappings;
 
     mutable std::mutex mMutex;  // guards what follows
     std::map<platform::Guid, std::shared_ptr<VideoSession>> mVideoSessions;
