@@ -140,19 +140,21 @@ void ProjectServer::Record(Event event) {
     mEvents.push_back(std::move(event));
 }
 
+Outcome ProjectServer::Guarded(const std::function<Outcome()>& work) {
+    try {
+        return work();
+    } catch (const ProjectError& e) {
+        return Outcome::Error(e.what());
+    } catch (const ItemsXmlError& e) {
+        return Outcome::Error(e.what());
+    }
+}
+
 void ProjectServer::Answer(const char* name, const ResponderPtr& responder, std::function<Outcome()> work) {
     auto self = weak_from_this().lock();
     if (!self) return responder->SendError(kPeerError, u"The peer is shutting down");
-    mService->Queue(Message(name),
-                    [self, work = std::move(work)]() -> Outcome {
-                        try {
-                            return work();
-                        } catch (const ProjectError& e) {
-                            return Outcome::Error(e.what());
-                        } catch (const ItemsXmlError& e) {
-                            return Outcome::Error(e.what());
-                        }
-                    },
+    // |work| holds the object through |self|.
+    mService->Queue(Message(name), [self, work = std::move(work)] { return work(); },
                     [responder](Outcome o) {
                         if (o.ok) {
                             responder->SendGeneralResult(o.value);
@@ -162,10 +164,10 @@ void ProjectServer::Answer(const char* name, const ResponderPtr& responder, std:
                     });
 }
 
-// ---- containers and sources ----
+// ---- the requests, as they run on the project queue ----
 
-void ProjectServer::GetContainer(const ResponderPtr& responder, const File& project, const Guid& containerID) {
-    Answer("GetContainer", responder, [this, project, containerID] {
+Outcome ProjectServer::ContainerOf(const File& project, const Guid& containerID) {
+    return Guarded([&] {
         const auto model = OpenProjectOrThrow(*mService, project.string());
         const Item& item = ItemOrThrow(*model, containerID);
         if (item.type != ItemType::Bin) throw ProjectError("\"" + item.path + "\" is not a bin");
@@ -176,27 +178,23 @@ void ProjectServer::GetContainer(const ResponderPtr& responder, const File& proj
     });
 }
 
-void ProjectServer::GetSource(const ResponderPtr& responder, const File& project, const Guid& sourceID) {
-    Answer("GetSource", responder, [this, project, sourceID] {
+Outcome ProjectServer::SourceOf(const File& project, const Guid& sourceID) {
+    return Guarded([&] {
         const auto model = OpenProjectOrThrow(*mService, project.string());
         return Outcome::Ok(Value(DescribeSource(*model, SourceOrThrow(*model, sourceID), mService->Role().serverName)));
     });
 }
 
-void ProjectServer::GetFarlandSource(const ResponderPtr& responder, const GenericAssetInfo&, const Guid&) {
-    responder->SendError(kPeerError, ToUTF16(kNoFarland));
-}
-
-void ProjectServer::IsSourceLinked(const ResponderPtr& responder, const File& project, const Guid& sourceID) {
-    Answer("IsSourceLinked", responder, [this, project, sourceID] {
+Outcome ProjectServer::Linked(const File& project, const Guid& sourceID) {
+    return Guarded([&] {
         const auto model = OpenProjectOrThrow(*mService, project.string());
         const Item* item = model->Find(sourceID);
         return Outcome::Ok(item != nullptr && item->type != ItemType::Bin);
     });
 }
 
-void ProjectServer::GetProjectSnapshot(const ResponderPtr& responder, const File& project, const Guid& sourceID) {
-    Answer("GetProjectSnapshot", responder, [this, project, sourceID] {
+Outcome ProjectServer::Snapshot(const File& project, const Guid& sourceID) {
+    return Guarded([&] {
         const auto model = OpenProjectOrThrow(*mService, project.string());
         Value reply = Value::object();
         reply["project"] = Value(model->Info());
@@ -205,8 +203,8 @@ void ProjectServer::GetProjectSnapshot(const ResponderPtr& responder, const File
     });
 }
 
-void ProjectServer::GetItemsAsXML(const ResponderPtr& responder, const File& project, const std::vector<Guid>& ids) {
-    Answer("GetItemsAsXML", responder, [this, project, ids] {
+Outcome ProjectServer::ItemsAsXml(const File& project, const std::vector<Guid>& ids) {
+    return Guarded([&] {
         const auto model = OpenProjectOrThrow(*mService, project.string());
         std::vector<const Item*> items;
         for (const Guid& id : ids) {
@@ -224,8 +222,6 @@ void ProjectServer::GetItemsAsXML(const ResponderPtr& responder, const File& pro
     });
 }
 
-// ---- creating ----
-
 Outcome ProjectServer::AddComposition(const File& file, const std::string& name, Composition comp) {
     const auto model = OpenProjectOrThrow(*mService, file.string());
     std::vector<Guid> added;
@@ -241,8 +237,8 @@ Outcome ProjectServer::AddComposition(const File& file, const std::string& name,
     return Outcome::Ok(Value(DescribeSource(*grown, created, mService->Role().serverName)));
 }
 
-void ProjectServer::CreateSource(const ResponderPtr& responder, const File& project, const SourceInfo& info) {
-    Answer("CreateSource", responder, [this, project, info] {
+Outcome ProjectServer::NewSource(const File& project, const SourceInfo& info) {
+    return Guarded([&] {
         if (!info.mFarlandProductionRequestInfo.IsEmpty()) throw ProjectError(kNoFarland);
         Composition comp;
         try {
@@ -254,9 +250,9 @@ void ProjectServer::CreateSource(const ResponderPtr& responder, const File& proj
     });
 }
 
-void ProjectServer::CreateSourceFromXML(const ResponderPtr& responder, const File& project, const std::string& xml,
-                                        const SourceInfo& info, const FarlandProductionInfo& production) {
-    Answer("CreateSourceFromXML", responder, [this, project, xml, info, production] {
+Outcome ProjectServer::NewSourceFromXml(const File& project, const std::string& xml, const SourceInfo& info,
+                                        const FarlandProductionInfo& production) {
+    return Guarded([&] {
         if (!production.IsEmpty() || !info.mFarlandProductionRequestInfo.IsEmpty()) throw ProjectError(kNoFarland);
         // The XML's composition (in our dialect) over the requested format; XML that holds none
         // (another application's) leaves the source as CreateSource makes it.
@@ -276,63 +272,92 @@ void ProjectServer::CreateSourceFromXML(const ResponderPtr& responder, const Fil
     });
 }
 
-void ProjectServer::CreateItemsFromXML(const std::string& xml) {
-    auto self = weak_from_this().lock();
-    if (!self) return;
-    mService->Queue(Message("CreateItemsFromXML"),
-                    [self, xml]() -> Outcome {
-                        Event event{"CreateItemsFromXML", {}, {}, false};
-                        try {
-                            ItemsDocument doc = ReadItemsXml(xml);
-                            const auto model = doc.project.empty() ? self->mService->MostRecentProject()
-                                                                   : OpenProjectOrThrow(*self->mService, doc.project);
-                            if (!model) throw ProjectError("No project is open");
-                            event.project = model->File();
-                            Guid parent;
-                            if (!doc.parent.empty()) {
-                                const auto id = Guid::Parse(std::string_view(doc.parent));
-                                const Item* bin = id ? model->Find(*id) : model->FindByPath(doc.parent);
-                                if (!bin) throw ProjectError("the project has no bin \"" + doc.parent + "\"");
-                                parent = bin->id;
-                            }
-                            const size_t count = doc.items.size();
-                            auto grown = std::make_shared<const ProjectModel>(model->WithItems(parent, std::move(doc.items)));
-                            if (!self->mService->ReplaceOpenProject(model, grown)) {
-                                throw ProjectError("the project changed meanwhile");
-                            }
-                            event.ok = true;
-                            event.detail = "added " + std::to_string(count) + " items";
-                        } catch (const std::exception& e) {
-                            event.detail = std::string("nothing added: ") + e.what();
-                        }
-                        self->Record(event);
-                        return event.ok ? Outcome::Ok(true) : Outcome::Error(event.detail);
-                    },
-                    nullptr);
+Outcome ProjectServer::AddItemsFromXml(const std::string& xml) {
+    Event event{"CreateItemsFromXML", {}, {}, false};
+    try {
+        ItemsDocument doc = ReadItemsXml(xml);
+        const auto model = doc.project.empty() ? mService->MostRecentProject() : OpenProjectOrThrow(*mService, doc.project);
+        if (!model) throw ProjectError("No project is open");
+        event.project = model->File();
+        Guid parent;
+        if (!doc.parent.empty()) {
+            const auto id = Guid::Parse(std::string_view(doc.parent));
+            const Item* bin = id ? model->Find(*id) : model->FindByPath(doc.parent);
+            if (!bin) throw ProjectError("the project has no bin \"" + doc.parent + "\"");
+            parent = bin->id;
+        }
+        const size_t count = doc.items.size();
+        auto grown = std::make_shared<const ProjectModel>(model->WithItems(parent, std::move(doc.items)));
+        if (!mService->ReplaceOpenProject(model, grown)) throw ProjectError("the project changed meanwhile");
+        event.ok = true;
+        event.detail = "added " + std::to_string(count) + " items";
+    } catch (const std::exception& e) {
+        event.detail = std::string("nothing added: ") + e.what();
+    }
+    Record(event);
+    return event.ok ? Outcome::Ok(true) : Outcome::Error(event.detail);
 }
 
-// ---- notifications that are only recorded ----
+Outcome ProjectServer::Show(const File& project, const Guid& sourceID) {
+    std::string detail = sourceID.ToString();
+    bool ok = false;
+    try {
+        const auto model = OpenProjectOrThrow(*mService, project.string());
+        const Item& item = ItemOrThrow(*model, sourceID);
+        detail += " \"" + item.path + "\"";
+        ok = true;
+    } catch (const ProjectError& e) {
+        detail += std::string(" (") + e.what() + ")";
+    }
+    Record(Event{"ShowSource", project, detail, ok});
+    return ok ? Outcome::Ok(true) : Outcome::Error(detail);
+}
+
+// ---- server::Project: queued, answered from the project queue ----
+
+void ProjectServer::GetContainer(const ResponderPtr& responder, const File& project, const Guid& containerID) {
+    Answer("GetContainer", responder, [this, project, containerID] { return ContainerOf(project, containerID); });
+}
+
+void ProjectServer::GetSource(const ResponderPtr& responder, const File& project, const Guid& sourceID) {
+    Answer("GetSource", responder, [this, project, sourceID] { return SourceOf(project, sourceID); });
+}
+
+void ProjectServer::GetFarlandSource(const ResponderPtr& responder, const GenericAssetInfo&, const Guid&) {
+    responder->SendError(kPeerError, ToUTF16(kNoFarland));
+}
+
+void ProjectServer::IsSourceLinked(const ResponderPtr& responder, const File& project, const Guid& sourceID) {
+    Answer("IsSourceLinked", responder, [this, project, sourceID] { return Linked(project, sourceID); });
+}
+
+void ProjectServer::GetProjectSnapshot(const ResponderPtr& responder, const File& project, const Guid& sourceID) {
+    Answer("GetProjectSnapshot", responder, [this, project, sourceID] { return Snapshot(project, sourceID); });
+}
+
+void ProjectServer::GetItemsAsXML(const ResponderPtr& responder, const File& project, const std::vector<Guid>& ids) {
+    Answer("GetItemsAsXML", responder, [this, project, ids] { return ItemsAsXml(project, ids); });
+}
+
+void ProjectServer::CreateSource(const ResponderPtr& responder, const File& project, const SourceInfo& info) {
+    Answer("CreateSource", responder, [this, project, info] { return NewSource(project, info); });
+}
+
+void ProjectServer::CreateSourceFromXML(const ResponderPtr& responder, const File& project, const std::string& xml,
+                                        const SourceInfo& info, const FarlandProductionInfo& production) {
+    Answer("CreateSourceFromXML", responder,
+           [this, project, xml, info, production] { return NewSourceFromXml(project, xml, info, production); });
+}
+
+void ProjectServer::CreateItemsFromXML(const std::string& xml) {
+    auto self = weak_from_this().lock();
+    if (self) mService->Queue(Message("CreateItemsFromXML"), [self, xml] { return self->AddItemsFromXml(xml); }, nullptr);
+}
 
 void ProjectServer::ShowSource(const File& project, const Guid& sourceID) {
-    auto self = weak_from_this().lock();
-    if (!self) return;
     // Looking the project up may touch the file system: not on the transport thread.
-    mService->Queue(Message("ShowSource"),
-                    [self, project, sourceID]() -> Outcome {
-                        std::string detail = sourceID.ToString();
-                        bool ok = false;
-                        try {
-                            const auto model = OpenProjectOrThrow(*self->mService, project.string());
-                            const Item& item = ItemOrThrow(*model, sourceID);
-                            detail += " \"" + item.path + "\"";
-                            ok = true;
-                        } catch (const ProjectError& e) {
-                            detail += std::string(" (") + e.what() + ")";
-                        }
-                        self->Record(Event{"ShowSource", project, detail, ok});
-                        return Outcome::Ok(ok);
-                    },
-                    nullptr);
+    auto self = weak_from_this().lock();
+    if (self) mService->Queue(Message("ShowSource"), [self, project, sourceID] { return self->Show(project, sourceID); }, nullptr);
 }
 
 void ProjectServer::SendFile(const File& project, const File& file) {

@@ -58,6 +58,19 @@ public:
 
     std::vector<Event> Events() const;
 
+    // What the project requests do, run where they are called (the handlers run them on the
+    // project queue). Refusals come back as outcomes, never as exceptions.
+    Outcome ContainerOf(const File& project, const Guid& containerID);
+    Outcome SourceOf(const File& project, const Guid& sourceID);
+    Outcome Linked(const File& project, const Guid& sourceID);
+    Outcome Snapshot(const File& project, const Guid& sourceID);
+    Outcome ItemsAsXml(const File& project, const std::vector<Guid>& ids);
+    Outcome NewSource(const File& project, const SourceInfo& info);
+    Outcome NewSourceFromXml(const File& project, const std::string& xml, const SourceInfo& info,
+                             const FarlandProductionInfo& production);
+    Outcome AddItemsFromXml(const std::string& xml);
+    Outcome Show(const File& project, const Guid& sourceID);
+
     // server::Project
     void GetContainer(const ResponderPtr& responder, const File& project, const Guid& containerID) override;
     void GetSource(const ResponderPtr& responder, const File& project, const Guid& sourceID) override;
@@ -77,8 +90,9 @@ private:
 
     // Queues |work| on the project queue and answers |responder| with its outcome.
     void Answer(const char* name, const ResponderPtr& responder, std::function<Outcome()> work);
+    static Outcome Guarded(const std::function<Outcome()>& work);
     void Record(Event event);
-    // Adds one composition to the open project |file| and answers its SourceInfo.
+    // Adds one composition to the open project |file| and answers its SourceInfo. Throws ProjectError.
     Outcome AddComposition(const File& file, const std::string& name, Composition comp);
 
     Outcome SourceRequest(const std::string& name, const platform::Value& args);

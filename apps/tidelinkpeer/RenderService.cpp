@@ -23,8 +23,6 @@ constexpr const char* kCat = "TideLinkPeer";
 constexpr const char* kNoFarland = "This peer serves no Farland productions";
 // Only buffers of the link manager's buffer service are written by direct renders.
 constexpr const char* kBufferPrefix = "tlmbuf-";
-// Bytes one audio chunk may take.
-constexpr uint64_t kMaxChunkBytes = uint64_t{256} << 20;
 
 std::string Message(const char* name) { return std::string(kMessagePrefix) + name; }
 
@@ -221,13 +219,13 @@ void RenderService::OwnerClosed(const void* owner) {
 void RenderService::Handle(const SessionPtr& from, const std::string& name, const Value& args, ReplyFn reply) {
     if (mStopping.load()) return Answer(reply, Outcome::Error("The peer is shutting down"));
     try {
-        if (name == kCreateVideoSession) return CreateVideoSession(from, args, std::move(reply));
-        if (name == kCreateAudioSession) return CreateAudioSession(from, args, std::move(reply));
+        if (name == kCreateVideoSession) return CreateVideoSession(from, args, reply);
+        if (name == kCreateAudioSession) return CreateAudioSession(from, args, reply);
         if (name == kRenderVideo || name == kRenderSessionVideo || name == kRenderVideoDirect ||
             name == kRenderSessionVideoDirect || name == kRenderVideoForFarland) {
-            return RenderVideoMessage(name, args, std::move(reply));
+            return RenderVideoMessage(name, args, reply);
         }
-        if (name == kRenderAudio || name == kRenderAudioAtTime) return RenderAudioMessage(name, args, std::move(reply));
+        if (name == kRenderAudio || name == kRenderAudioAtTime) return RenderAudioMessage(name, args, reply);
         if (name == kCreateFarlandVideoSession || name == kCreateFarlandAudioSession) {
             return Answer(reply, Outcome::Error(kNoFarland));
         }
@@ -270,7 +268,7 @@ void RenderService::Handle(const SessionPtr& from, const std::string& name, cons
     }
 }
 
-void RenderService::CreateVideoSession(const SessionPtr& from, const Value& args, ReplyFn reply) {
+void RenderService::CreateVideoSession(const SessionPtr& from, const Value& args, ReplyFn& reply) {
     Args a(args, kCreateVideoSession, "(project path, source id, options)");
     auto session = std::make_shared<VideoSession>();
     session->project = a.Text(0, "the project path");
@@ -302,7 +300,7 @@ void RenderService::CreateVideoSession(const SessionPtr& from, const Value& args
         std::move(reply));
 }
 
-void RenderService::CreateAudioSession(const SessionPtr& from, const Value& args, ReplyFn reply) {
+void RenderService::CreateAudioSession(const SessionPtr& from, const Value& args, ReplyFn& reply) {
     Args a(args, kCreateAudioSession, "(project path, source id, options, start time, samples per buffer)");
     auto session = std::make_shared<AudioSession>();
     session->project = a.Text(0, "the project path");
@@ -323,8 +321,6 @@ void RenderService::CreateAudioSession(const SessionPtr& from, const Value& args
                 const auto [model, item] = FindComposition(*self->mService, session->project, session->source);
                 session->format = ResolveAudioFormat(*item->composition, options);
                 if (session->format.Channels() == 0) throw RenderError("The channel layout is empty");
-                const uint64_t bytes = uint64_t{session->format.Channels()} * session->samplesPerBuffer * 4;
-                if (bytes > kMaxChunkBytes) throw RenderError("A chunk would take more than 256 MiB");
                 session->next = SampleAtOrBefore(start, session->format.sampleRate);
             } catch (const ProjectError& e) {
                 return Outcome::Error(e.what());
@@ -387,10 +383,11 @@ void RenderService::Fail(const Guid& frame, bool publish, int code, const std::s
     });
 }
 
-void RenderService::RenderVideoMessage(const std::string& name, const Value& args, ReplyFn reply) {
+void RenderService::RenderVideoMessage(const std::string& name, const Value& args, ReplyFn& reply) {
     if (name == kRenderVideoForFarland) {
         Args a(args, name, "(Farland asset, frame, time, options)");
-        return Fail(a.Id(1, "the frame"), true, pc::kResultNotAvailable, kNoFarland, std::move(reply));
+        const Guid frame = a.Id(1, "the frame");
+        return Fail(frame, true, pc::kResultNotAvailable, kNoFarland, std::move(reply));
     }
     const bool session = name == kRenderSessionVideo || name == kRenderSessionVideoDirect;
     const bool direct = name == kRenderVideoDirect || name == kRenderSessionVideoDirect;
@@ -444,7 +441,7 @@ void RenderService::RenderVideoMessage(const std::string& name, const Value& arg
     mRender->Post([self, job, work = std::move(work), reply = std::move(reply)] { self->RunVideo(job, work, reply); });
 }
 
-void RenderService::RenderAudioMessage(const std::string& name, const Value& args, ReplyFn reply) {
+void RenderService::RenderAudioMessage(const std::string& name, const Value& args, ReplyFn& reply) {
     const bool atTime = name == kRenderAudioAtTime;
     Args a(args, name, atTime ? "(session, frame, time)" : "(session, frame)");
     const Guid frame = a.Id(1, "the frame");

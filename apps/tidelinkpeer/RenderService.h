@@ -120,10 +120,12 @@ private:
 
     RenderService(std::shared_ptr<PeerService> service, platform::ExecutorPtr renderExecutor, Limits limits);
 
-    void CreateVideoSession(const platform::SessionPtr& from, const platform::Value& args, ReplyFn reply);
-    void CreateAudioSession(const platform::SessionPtr& from, const platform::Value& args, ReplyFn reply);
-    void RenderVideoMessage(const std::string& name, const platform::Value& args, ReplyFn reply);
-    void RenderAudioMessage(const std::string& name, const platform::Value& args, ReplyFn reply);
+    // These take |reply| by reference and move it only once the arguments are read: Handle
+    // answers what they refuse.
+    void CreateVideoSession(const platform::SessionPtr& from, const platform::Value& args, ReplyFn& reply);
+    void CreateAudioSession(const platform::SessionPtr& from, const platform::Value& args, ReplyFn& reply);
+    void RenderVideoMessage(const std::string& name, const platform::Value& args, ReplyFn& reply);
+    void RenderAudioMessage(const std::string& name, const platform::Value& args, ReplyFn& reply);
 
     // Takes |frame| into the jobs in flight; null (and |reply| answered) when it cannot be.
     std::shared_ptr<Job> Admit(const platform::Guid& frame, bool publishes, ReplyFn& reply);

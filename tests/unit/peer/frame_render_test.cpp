@@ -45,44 +45,13 @@ Composition Comp(int32_t w, int32_t h) {
     return c;
 }
 
-// The reference: the whole drawn frame through RenderCompositionFrame, cropped to the window, in
-// the geometry's byte order. Interlaced frames take the second field's rows from a second frame.
-std::vector<uint8_t> Reference(const Composition& comp, const Rational& time, const FrameGeometry& g) {
-    const size_t fullRow = static_cast<size_t>(g.frameWidth) * 4;
-    auto draw = [&](const Rational& t) {
-        std::vector<uint8_t> full(fullRow * static_cast<size_t>(g.frameHeight));
-        RenderCompositionFrame(comp, t, FrameView{full.data(), g.frameWidth, g.frameHeight, fullRow});
-        return full;
-    };
-    const auto first = draw(time);
-    std::vector<uint8_t> second;
-    const bool interlaced = g.fieldType == FieldType::UpperFirst || g.fieldType == FieldType::LowerFirst;
-    if (interlaced) second = draw(SecondFieldTime(comp.frameRate, time));
-    const int firstParity = g.fieldType == FieldType::UpperFirst ? 0 : 1;
-    std::vector<uint8_t> out(g.RowBytes() * static_cast<size_t>(g.height));
-    for (int32_t j = 0; j < g.height; ++j) {
-        const int32_t y = g.y + j;
-        const auto& src = interlaced && (y % 2) != firstParity ? second : first;
-        for (int32_t i = 0; i < g.width; ++i) {
-            const uint8_t* p = src.data() + static_cast<size_t>(y) * fullRow + static_cast<size_t>(g.x + i) * 4;
-            uint8_t* q = out.data() + static_cast<size_t>(j) * g.RowBytes() + static_cast<size_t>(i) * 4;
-            const bool rgba = g.pixelFormat == kPixelFormatRGBA;
-            q[0] = rgba ? p[2] : p[0];
-            q[1] = p[1];
-            q[2] = rgba ? p[0] : p[2];
-            q[3] = p[3];
-        }
-    }
-    return out;
-}
-
 // Composes into rows with padding (filled with a marker that must survive) and compares.
 void ExpectSameAsReference(const Composition& comp, const Rational& time, const FrameGeometry& g,
                            const std::string& what) {
     const size_t rowBytes = g.RowBytes() + 20;
     std::vector<uint8_t> rows(rowBytes * static_cast<size_t>(g.height), 0xC3);
     ComposeFrame(comp, time, g, rows.data(), rowBytes);
-    const auto expected = Reference(comp, time, g);
+    const auto expected = test::ExpectedFrame(comp, time, g);
     for (int32_t j = 0; j < g.height; ++j) {
         const uint8_t* got = rows.data() + static_cast<size_t>(j) * rowBytes;
         const uint8_t* want = expected.data() + static_cast<size_t>(j) * g.RowBytes();
