@@ -124,7 +124,78 @@ private:
     std::shared_ptr<State> mState;
 };
 
+// Threads of its own; they end when the pool goes, after the queue is empty.
+class WorkerPool final : public Executor {
+    struct State {
+        std::mutex mutex;
+        std::condition_variable wake;
+        std::condition_variable idle;
+        std::deque<Task> tasks;
+        size_t outstanding = 0;
+        bool closing = false;
+    };
+
+public:
+    explicit WorkerPool(unsigned threads) : mState(std::make_shared<State>()) {
+        for (unsigned i = 0; i < threads; ++i) mThreads.emplace_back([state = mState] { Run(*state); });
+    }
+
+    ~WorkerPool() override {
+        {
+            std::lock_guard lock(mState->mutex);
+            mState->closing = true;
+        }
+        mState->wake.notify_all();
+        for (auto& t : mThreads) {
+            if (t.get_id() == std::this_thread::get_id()) {
+                t.detach();  // let go by one of its own tasks: this thread ends after it
+            } else {
+                t.join();
+            }
+        }
+    }
+
+    void Post(Task task) override {
+        {
+            std::lock_guard lock(mState->mutex);
+            mState->tasks.push_back(std::move(task));
+            ++mState->outstanding;
+        }
+        mState->wake.notify_one();
+    }
+
+    void WaitUntilIdle() override {
+        std::unique_lock lock(mState->mutex);
+        mState->idle.wait(lock, [this] { return mState->outstanding == 0; });
+    }
+
+private:
+    static void Run(State& state) {
+        std::unique_lock lock(state.mutex);
+        for (;;) {
+            state.wake.wait(lock, [&state] { return !state.tasks.empty() || state.closing; });
+            if (state.tasks.empty()) return;
+            Task task = std::move(state.tasks.front());
+            state.tasks.pop_front();
+            lock.unlock();
+            RunGuarded(task);
+            task = nullptr;
+            lock.lock();
+            if (--state.outstanding == 0) state.idle.notify_all();
+        }
+    }
+
+    std::shared_ptr<State> mState;
+    std::vector<std::thread> mThreads;
+};
+
 }  // namespace
+
+ExecutorPtr CreateWorkerPool(unsigned threads) {
+    return std::make_shared<WorkerPool>(threads == 0 ? std::max(2u, HardwareThreadCount()) : threads);
+}
+
+unsigned HardwareThreadCount() { return std::max(1u, std::thread::hardware_concurrency()); }
 
 ExecutorPtr CreateCPUBoundExecutor() {
     static ExecutorPtr* pool = new ExecutorPtr(std::make_shared<ThreadPool>(

@@ -63,35 +63,16 @@ inline void Over(uint8_t* p, Color8 c) {
     p[3] = static_cast<uint8_t>((c.a * 255u + p[3] * (255u - c.a) + 127) / 255);
 }
 
-// A rectangle of composition pixels in view pixels, clipped to the view: [x0, x1) x [y0, y1).
-struct Span {
-    int32_t x0, y0, x1, y1;
-    bool Empty() const { return x0 >= x1 || y0 >= y1; }
-};
-
 int32_t Scale(int64_t v, int32_t to, int32_t from) {
     return static_cast<int32_t>(FloorDiv(static_cast<Int128>(v) * to, from));
 }
 
-Span MapRect(const std::optional<PixelRect>& rect, const Composition& comp, const FrameView& view) {
-    if (!rect) return {0, 0, view.width, view.height};
-    Span s{Scale(rect->x, view.width, comp.width), Scale(rect->y, view.height, comp.height),
-           Scale(int64_t{rect->x} + rect->width, view.width, comp.width),
-           Scale(int64_t{rect->y} + rect->height, view.height, comp.height)};
-    s.x0 = std::clamp(s.x0, 0, view.width);
-    s.x1 = std::clamp(s.x1, 0, view.width);
-    s.y0 = std::clamp(s.y0, 0, view.height);
-    s.y1 = std::clamp(s.y1, 0, view.height);
-    return s;
-}
-
-uint8_t Lerp(uint8_t from, uint8_t to, int64_t i, int64_t n) {
-    if (n <= 1) return from;
-    return static_cast<uint8_t>((from * (n - 1 - i) + to * i + (n - 1) / 2) / (n - 1));
+PixelSpan MapRect(const std::optional<PixelRect>& rect, const Composition& comp, const FrameView& view) {
+    return LayerSpan(rect, comp, view.width, view.height);
 }
 
 void DrawSolid(const SolidLayer& s, const Composition& comp, const FrameView& view) {
-    const Span span = MapRect(s.rect, comp, view);
+    const PixelSpan span = MapRect(s.rect, comp, view);
     if (span.Empty()) return;
     for (int32_t y = span.y0; y < span.y1; ++y) {
         for (int32_t x = span.x0; x < span.x1; ++x) Over(PixelAt(view, x, y), s.color);
@@ -99,15 +80,15 @@ void DrawSolid(const SolidLayer& s, const Composition& comp, const FrameView& vi
 }
 
 void DrawGradient(const GradientLayer& g, const Composition& comp, const FrameView& view) {
-    const Span span = MapRect(g.rect, comp, view);
+    const PixelSpan span = MapRect(g.rect, comp, view);
     if (span.Empty()) return;
     const bool horizontal = g.direction == GradientLayer::Direction::Horizontal;
     const int64_t n = horizontal ? span.x1 - span.x0 : span.y1 - span.y0;
     for (int32_t y = span.y0; y < span.y1; ++y) {
         for (int32_t x = span.x0; x < span.x1; ++x) {
             const int64_t i = horizontal ? x - span.x0 : y - span.y0;
-            const Color8 c{Lerp(g.from.r, g.to.r, i, n), Lerp(g.from.g, g.to.g, i, n),
-                           Lerp(g.from.b, g.to.b, i, n), Lerp(g.from.a, g.to.a, i, n)};
+            const Color8 c{GradientComponent(g.from.r, g.to.r, i, n), GradientComponent(g.from.g, g.to.g, i, n),
+                           GradientComponent(g.from.b, g.to.b, i, n), GradientComponent(g.from.a, g.to.a, i, n)};
             Over(PixelAt(view, x, y), c);
         }
     }
@@ -143,6 +124,31 @@ Rational TimeOfFrame(const Rational& frameRate, int64_t frame) {
     if (num > INT64_MAX || num < INT64_MIN) throw std::overflow_error("frame time out of range");
     return Rational(static_cast<int64_t>(num), static_cast<int64_t>(den));
 }
+
+PixelSpan LayerSpan(const std::optional<PixelRect>& rect, const Composition& comp, int32_t width, int32_t height) {
+    if (!rect) return {0, 0, width, height};
+    PixelSpan s{Scale(rect->x, width, comp.width), Scale(rect->y, height, comp.height),
+                Scale(int64_t{rect->x} + rect->width, width, comp.width),
+                Scale(int64_t{rect->y} + rect->height, height, comp.height)};
+    s.x0 = std::clamp(s.x0, 0, width);
+    s.x1 = std::clamp(s.x1, 0, width);
+    s.y0 = std::clamp(s.y0, 0, height);
+    s.y1 = std::clamp(s.y1, 0, height);
+    return s;
+}
+
+uint8_t GradientComponent(uint8_t from, uint8_t to, int64_t i, int64_t n) {
+    if (n <= 1) return from;
+    return static_cast<uint8_t>((from * (n - 1 - i) + to * i + (n - 1) / 2) / (n - 1));
+}
+
+int32_t PatternBandHeight(int32_t height) { return BandHeight(height); }
+
+uint32_t PatternHash(int64_t frame) {
+    return static_cast<uint32_t>(SplitMix64(static_cast<uint64_t>(frame)) & 0xFFFFFF);
+}
+
+bool PatternCellIsWhite(int64_t frame, int32_t cell) { return CodeBit(static_cast<uint32_t>(frame), cell); }
 
 Color8 PatternFieldColor(int64_t frame, int32_t x, int32_t y, int32_t width, int32_t height) {
     const uint64_t h = SplitMix64(static_cast<uint64_t>(frame));

@@ -44,6 +44,13 @@ Color8 PatternFieldColor(int64_t frame, int32_t x, int32_t y, int32_t width, int
 // Draws the pattern of |frame| over the whole view (opaque).
 void DrawPattern(const FrameView& view, int64_t frame);
 
+// The pieces of the pattern, for renderers that draw it row by row: the rows of the code band
+// of a frame |height| rows high, the 24-bit colour hash of |frame| (R base in bits 0-7, G base
+// in 8-15, B in 16-23), and whether code cell |cell| (0 to kCodeCells - 1) of |frame| is white.
+int32_t PatternBandHeight(int32_t height);
+uint32_t PatternHash(int64_t frame);
+bool PatternCellIsWhite(int64_t frame, int32_t cell);
+
 // Reads the frame number back from a frame drawn with DrawPattern (at any size with
 // width >= kCodeCells). Samples the middle of each cell; nullopt when the markers or the check
 // bits do not match.
@@ -51,6 +58,20 @@ std::optional<int64_t> DecodePatternFrame(const uint8_t* bgra, int32_t width, in
                                           size_t rowBytes);
 
 // ---- compositions ----
+
+// The pixels [x0, x1) x [y0, y1) of a width x height frame that a layer's rectangle covers (the
+// whole frame when it has none), clipped to the frame. Edges land at floor(p * size / compSize).
+struct PixelSpan {
+    int32_t x0 = 0;
+    int32_t y0 = 0;
+    int32_t x1 = 0;
+    int32_t y1 = 0;
+    bool Empty() const { return x0 >= x1 || y0 >= y1; }
+};
+PixelSpan LayerSpan(const std::optional<PixelRect>& rect, const Composition& comp, int32_t width, int32_t height);
+
+// Component |i| of |n| of a gradient from |from| to |to|.
+uint8_t GradientComponent(uint8_t from, uint8_t to, int64_t i, int64_t n);
 
 // Renders |comp| at |time| into |view|. The view may be of any size: layer geometry given in
 // composition pixels is scaled to it; the pattern is laid out relative to the view. The

@@ -25,6 +25,15 @@ using namespace platform;
 
 namespace {
 constexpr const char* kCat = "TideLinkPeer";
+
+// One per hardware thread and two more (TIDELINK_RENDER_THREADS: 1 to 64).
+unsigned RenderThreads() {
+    if (const char* env = std::getenv("TIDELINK_RENDER_THREADS")) {
+        const int n = std::atoi(env);
+        if (n >= 1 && n <= 64) return static_cast<unsigned>(n);
+    }
+    return HardwareThreadCount() + 2;
+}
 }  // namespace
 
 PeerRuntime::PeerRuntime(PeerRuntimeOptions options) : mOptions(std::move(options)) {}
@@ -49,6 +58,11 @@ bool PeerRuntime::Start(std::string& error) {
         if (auto service = weakService.lock()) service->ForgetEndpoint(endpoint);
     });
     mService->Register(mRegistrar);
+    mProjects = ProjectServer::Create(mService, mRegistrar);
+    // Frames are drawn on every core, several at once, on threads of their own: drawing waits for
+    // the link manager's buffers, and the extra threads draw meanwhile.
+    mRenders = RenderService::Create(mService, CreateWorkerPool(RenderThreads()));
+    mRenders->Register(mRegistrar);
     mRpcServer = std::make_shared<RPCServer>(mServer, "TideLinkPeer", mRegistrar);
     TL_TRACE(kCat, 3) << mOptions.role.serverName << " serving on " << mAddress << ":" << mPort;
     if (mOptions.announce && !Announce(error)) return false;
@@ -151,6 +165,11 @@ void PeerRuntime::Stop() {
     if (!mStarted) return;
     // No new requests; the sessions of hosts close.
     if (mServer) mServer->Stop();
+    if (mRenders) {
+        mRenders->Unregister(mRegistrar);
+        mRenders->Shutdown();
+    }
+    if (mProjects) mProjects->Stop();
     if (mService) {
         mService->Unregister(mRegistrar);
         mService->Shutdown(mOptions.shutdownFlushMs);
@@ -164,6 +183,8 @@ void PeerRuntime::Stop() {
     }
     mRpcServer.reset();
     mServer.reset();
+    mRenders.reset();
+    mProjects.reset();
     mService.reset();
     mNotifier.reset();
     mTransport.reset();

@@ -16,6 +16,8 @@
 
 #include "PeerRole.h"
 #include "PeerService.h"
+#include "ProjectServer.h"
+#include "RenderService.h"
 #include "platform/Rpc.h"
 #include "platform/Transport.h"
 
@@ -56,11 +58,14 @@ public:
     uint16_t Port() const { return mPort; }
     bool Announced() const { return mAnnounced; }
     const std::shared_ptr<PeerService>& Service() const { return mService; }
+    const std::shared_ptr<ProjectServer>& Projects() const { return mProjects; }
+    const std::shared_ptr<RenderService>& Renders() const { return mRenders; }
 
     // Blocks until RequestStop, or until the session to the link manager closes.
     StopReason WaitForStop();
     void RequestStop(StopReason reason = StopReason::Requested);
-    // Stops listening, finishes the project work, tells every status registration that the peer
+    // Stops listening, ends the renders (queued frames are published as cancelled, those being
+    // drawn are finished), finishes the project work, tells every status registration that the peer
     // is gone, takes the announcement back (dedicated session) and releases every session.
     // Idempotent.
     void Stop();
@@ -75,6 +80,8 @@ private:
     platform::RPCServerPtr mRpcServer;
     std::shared_ptr<EndpointNotifier> mNotifier;
     std::shared_ptr<PeerService> mService;
+    std::shared_ptr<ProjectServer> mProjects;
+    std::shared_ptr<RenderService> mRenders;
     platform::RPCClientPtr mManager;
     platform::Guid mManagerCloseHandler;
     std::string mAddress;

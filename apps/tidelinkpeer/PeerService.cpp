@@ -7,6 +7,7 @@
 #include <stdexcept>
 #include <system_error>
 
+#include "Arguments.h"
 #include "platform/Trace.h"
 #include "tidelink/peers/ProjectProtocol.h"
 
@@ -18,74 +19,11 @@ namespace fs = std::filesystem;
 namespace {
 
 constexpr const char* kCat = "TideLinkPeer";
-constexpr const char* kPrefix = "com.quenlo.tidelink.";
 
 // Progress messages: localisation key and default text; "@0" is the argument.
 constexpr const char* kOpeningProgress = "$$$/tidelinkpeer/OpeningProject=Opening @0...";
 constexpr const char* kOpenedProgress = "$$$/tidelinkpeer/ProjectOpened=Opened @0";
 constexpr const char* kOpenFailedProgress = "$$$/tidelinkpeer/OpenProjectFailed=Cannot open @0";
-
-std::string ShortName(const std::string& name) {
-    return name.rfind(kPrefix, 0) == 0 ? name.substr(std::strlen(kPrefix)) : name;
-}
-
-// Arguments that do not fit the message.
-class BadArguments : public std::runtime_error {
-public:
-    using std::runtime_error::runtime_error;
-};
-
-// Positional arguments of one message; every reader throws BadArguments with a sentence that
-// names the message and what it expects.
-class Args {
-public:
-    Args(const Value& args, const std::string& message, const char* signature)
-        : mArgs(args), mMessage(ShortName(message)), mSignature(signature) {
-        if (!args.is_array() && !args.is_null()) Bad("the arguments are not a list");
-    }
-
-    size_t Size() const { return mArgs.is_array() ? mArgs.size() : 0; }
-
-    const Value& At(size_t i) const {
-        if (i >= Size()) Bad("argument " + std::to_string(i + 1) + " is missing");
-        return mArgs[i];
-    }
-
-    std::string Text(size_t i, const char* what) const {
-        const Value& v = At(i);
-        if (!v.is_string()) Bad("argument " + std::to_string(i + 1) + " (" + what + ") must be a string");
-        return v.get<std::string>();
-    }
-
-    ServerConnection Endpoint(size_t i) const {
-        ServerConnection c = Record<ServerConnection>(i, "the endpoint {\"address\", \"port\"}");
-        if (c.mAddress.empty() || c.mPort == 0) {
-            Bad("argument " + std::to_string(i + 1) + " (the endpoint) needs an address and a port");
-        }
-        return c;
-    }
-
-    template <class T>
-    T Record(size_t i, const char* what) const {
-        const Value& v = At(i);
-        try {
-            return v.get<T>();
-        } catch (const nlohmann::json::exception& e) {
-            Bad("argument " + std::to_string(i + 1) + " (" + what + ") cannot be read: " + e.what());
-        } catch (const boost::bad_rational& e) {
-            Bad("argument " + std::to_string(i + 1) + " (" + what + ") cannot be read: " + e.what());
-        }
-    }
-
-    [[noreturn]] void Bad(const std::string& why) const {
-        throw BadArguments("Bad arguments for " + mMessage + " " + mSignature + ": " + why);
-    }
-
-private:
-    const Value& mArgs;
-    std::string mMessage;
-    const char* mSignature;
-};
 
 bool EqualsIgnoringCase(const std::string& a, const std::string& b) {
     return a.size() == b.size() && std::equal(a.begin(), a.end(), b.begin(), [](char x, char y) {
@@ -213,6 +151,10 @@ void PeerService::Handle(const std::string& name, const Value& args, ReplyFn rep
 }
 
 void PeerService::Queue(const std::string& name, std::function<Outcome()> work, ReplyFn reply) {
+    if (mStopping.load()) {
+        if (reply) reply(Outcome::Error("The peer is shutting down"));
+        return;
+    }
     mQueue->Post([name, work = std::move(work), reply = std::move(reply)] {
         Outcome o;
         try {
@@ -461,6 +403,32 @@ void PeerService::Shutdown(int flushTimeoutMs) {
         if (!mSink->Flush(flushTimeoutMs)) TL_TRACE(kCat, 1) << "Not every host confirmed the last notifications";
         mSink->Close();
     }
+}
+
+std::shared_ptr<const ProjectModel> PeerService::OpenProject(const std::string& path) const {
+    {
+        std::lock_guard lock(mMutex);
+        if (auto it = mOpen.find(fs::path(path)); it != mOpen.end()) return it->second;
+    }
+    const fs::path key = ProjectKey(path);
+    std::lock_guard lock(mMutex);
+    auto it = mOpen.find(key);
+    return it == mOpen.end() ? nullptr : it->second;
+}
+
+std::shared_ptr<const ProjectModel> PeerService::MostRecentProject() const {
+    std::lock_guard lock(mMutex);
+    return mOpenOrder.empty() ? nullptr : mOpen.at(mOpenOrder.back());
+}
+
+bool PeerService::ReplaceOpenProject(const std::shared_ptr<const ProjectModel>& current,
+                                     std::shared_ptr<const ProjectModel> replacement) {
+    if (!current || !replacement || current->File() != replacement->File()) return false;
+    std::lock_guard lock(mMutex);
+    auto it = mOpen.find(current->File());
+    if (it == mOpen.end() || it->second != current) return false;
+    it->second = std::move(replacement);
+    return true;
 }
 
 std::shared_ptr<const ProjectModel> PeerService::FindOpenProject(const fs::path& file) const {

@@ -92,6 +92,23 @@ public:
     // An endpoint that cannot be reached loses its registrations.
     void ForgetEndpoint(const ServerConnection& endpoint);
 
+    // Runs |work| on the project queue, after the project messages that arrived before, and
+    // passes its outcome to |reply| (exactly once, also when |work| throws). Refused once
+    // shutdown began.
+    void Queue(const std::string& name, std::function<Outcome()> work, ReplyFn reply);
+    bool Stopping() const { return mStopping.load(); }
+
+    // The open project that |path| names (any spelling of its file), or null. Looks the path up
+    // as given first, and only then resolves it on the file system. Throws ProjectError for a
+    // path that is not absolute.
+    std::shared_ptr<const ProjectModel> OpenProject(const std::string& path) const;
+    // The most recently opened project that is still open, or null.
+    std::shared_ptr<const ProjectModel> MostRecentProject() const;
+    // Puts |replacement| (a changed copy) in the place of |current| when |current| is still what
+    // is open under its file; false otherwise.
+    bool ReplaceOpenProject(const std::shared_ptr<const ProjectModel>& current,
+                            std::shared_ptr<const ProjectModel> replacement);
+
     // For tests and traces.
     std::shared_ptr<const ProjectModel> FindOpenProject(const std::filesystem::path& file) const;
     std::vector<std::filesystem::path> OpenProjectFiles() const;  // most recently opened last
@@ -118,8 +135,6 @@ private:
     };
 
     PeerService(PeerRole role, platform::ExecutorPtr executor, std::shared_ptr<NotificationSink> sink);
-
-    void Queue(const std::string& name, std::function<Outcome()> work, ReplyFn reply);
 
     Outcome Connect(const std::string& name, const platform::Value& args);
     Outcome Open(const platform::Value& args, bool withJSON);

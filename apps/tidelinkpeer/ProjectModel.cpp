@@ -617,6 +617,67 @@ const Item* ProjectModel::FindByPath(std::string_view path) const {
     return nullptr;
 }
 
+ProjectModel ProjectModel::WithItems(const Guid& parent, std::vector<NewItem> items, std::vector<Guid>* added) const {
+    const Item* target = Find(parent);
+    if (!target) throw ProjectError("the project has no item " + parent.ToString());
+    if (target->type != ItemType::Bin) throw ProjectError("\"" + target->path + "\" is not a bin");
+    ProjectModel out = *this;
+    const fs::path dir = mFile.parent_path();
+    std::set<std::string> reported;
+    for (const auto& f : out.mMissing.mMissingFootage) reported.insert(platform::ToUTF8(f.mPath));
+    auto resolve = [&](FootageRef& f) {
+        if (f.path.empty() || f.path.find('\0') != std::string::npos) throw ProjectError("a footage path is empty");
+        f.resolved = ResolveFootage(dir, f.path);
+        f.missing = !IsRegularFile(f.resolved);
+        if (f.missing && reported.insert(f.resolved.string()).second) {
+            out.mMissing.mMissingFootage.push_back({platform::ToUTF16(f.resolved.string())});
+        }
+    };
+    auto add = [&](auto& self, size_t parentIndex, NewItem& n) -> Guid {
+        if (out.mItems.size() >= kMaxItems) {
+            throw ProjectError("a project holds at most " + std::to_string(kMaxItems) + " items");
+        }
+        ReadName(Value(n.name), "the name \"" + n.name.substr(0, 64) + "\"");
+        Item item;
+        item.type = n.type;
+        item.name = n.name;
+        int sameName = 1;
+        for (size_t sibling : out.mItems[parentIndex].children) {
+            if (out.mItems[sibling].name == n.name) ++sameName;
+        }
+        const std::string segment = sameName == 1 ? n.name : n.name + "#" + std::to_string(sameName);
+        item.path = ChildPath(out.mItems[parentIndex].path, segment);
+        item.id = n.id && !n.id->IsNil() && !out.mById.count(*n.id) ? *n.id : Guid::New();
+        while (out.mById.count(item.id)) item.id = Guid::New();
+        item.parent = out.mItems[parentIndex].id;
+        if (n.type == ItemType::Composition) {
+            if (!n.composition) throw ProjectError("the composition \"" + n.name + "\" has no format");
+            item.composition = std::move(n.composition);
+            for (Layer& layer : item.composition->layers) {
+                if (auto* f = std::get_if<FootageRef>(&layer.content)) resolve(*f);
+            }
+        } else if (n.type == ItemType::Footage) {
+            FootageRef f;
+            f.path = n.footagePath;
+            resolve(f);
+            item.footage = std::move(f);
+        }
+        const size_t index = out.mItems.size();
+        const Guid id = item.id;
+        out.mItems.push_back(std::move(item));
+        out.mItems[parentIndex].children.push_back(index);
+        out.mById.emplace(id, index);
+        for (NewItem& child : n.children) self(self, index, child);
+        return id;
+    };
+    const size_t parentIndex = parent.IsNil() ? 0 : mById.at(target->id);
+    for (NewItem& n : items) {
+        const Guid id = add(add, parentIndex, n);
+        if (added) added->push_back(id);
+    }
+    return out;
+}
+
 ItemInfo ProjectModel::InfoOf(const Item& item) const {
     return ItemInfo{platform::ToUTF16(item.name), item.id, static_cast<int32_t>(item.type)};
 }

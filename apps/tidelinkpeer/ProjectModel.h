@@ -137,6 +137,17 @@ struct DocumentOverrides {
 // Reads the JSON text of OpenProjectWithJSON. Empty text means no overrides. Throws ProjectError.
 DocumentOverrides ParseOverrides(std::string_view json);
 
+// An item to add to an open project (created by a host): a bin with what it holds, a composition
+// or a footage item.
+struct NewItem {
+    ItemType type = ItemType::Bin;
+    std::string name;
+    std::optional<Guid> id;                   // a fresh id when absent or already taken
+    std::optional<Composition> composition;   // compositions
+    std::string footagePath;                  // footage: as given, relative to the project's folder
+    std::vector<NewItem> children;            // bins
+};
+
 class ProjectModel {
 public:
     // Limits on what one document may hold.
@@ -165,6 +176,13 @@ public:
     // nullptr when no item has |id|. The nil GUID names the root.
     const Item* Find(const Guid& id) const;
     const Item* FindByPath(std::string_view path) const;
+
+    // A copy of this model with |items| added, in order, at the end of the bin |parent| (the nil
+    // GUID names the root). Names follow the document's rules; footage paths (of items and of
+    // layers) are resolved against the project's folder and missing files are added to Missing().
+    // |added| receives the ids of the new top-level items. Throws ProjectError when |parent| is
+    // not a bin of the project, a name is unusable, or the project would hold too many items.
+    ProjectModel WithItems(const Guid& parent, std::vector<NewItem> items, std::vector<Guid>* added = nullptr) const;
 
     tidelink::ItemInfo InfoOf(const Item& item) const;
     std::vector<tidelink::ItemInfo> ChildrenOf(const Item& item) const;

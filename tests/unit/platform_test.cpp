@@ -148,6 +148,39 @@ TEST_F(ExecutorTest, WaitUntilIdleCoversTasksPostedMeanwhile) {
     }
 }
 
+TEST_F(ExecutorTest, WorkerPoolRunsWaitingTasksBesideTheCPUPoolAndDrainsWhenLetGo) {
+    // Tasks that wait for a CPU-pool task must not starve it: a worker pool has threads of its own.
+    auto workers = CreateWorkerPool(3);
+    Gate cpuRan;
+    std::atomic<int> saw{0};
+    for (int i = 0; i < 3; ++i) {
+        workers->Post([&] {
+            if (cpuRan.Wait(kLongWaitMs)) ++saw;
+        });
+    }
+    CreateCPUBoundExecutor()->Post([&] { cpuRan.Open(); });
+    workers->WaitUntilIdle();
+    EXPECT_EQ(saw.load(), 3);
+
+    // Letting it go runs what is queued, also when the last reference goes on one of its threads.
+    std::atomic<int> ran{0};
+    {
+        auto pool = CreateWorkerPool(1);
+        for (int i = 0; i < 50; ++i) pool->Post([&] { ++ran; });
+    }
+    EXPECT_EQ(ran.load(), 50);
+    Gate last;
+    {
+        auto pool = CreateWorkerPool(2);
+        pool->Post([pool, &last]() mutable {
+            pool.reset();
+            last.Open();
+        });
+    }
+    EXPECT_TRUE(last.Wait(kLongWaitMs));
+    EXPECT_GE(HardwareThreadCount(), 1u);
+}
+
 TEST_F(ExecutorTest, ThrowingTaskDoesNotStopTheExecutor) {
     auto pool = CreateCPUBoundExecutor();
     auto serial = CreateSubExecutor(pool, 1);

@@ -11,6 +11,7 @@ using namespace platform;
 struct Project::Gate {
     std::shared_mutex mutex;
     Project* project = nullptr;
+    MessageRegistrarPtr registrar;
 };
 
 namespace {
@@ -88,9 +89,12 @@ const std::vector<std::string>& Project::MessageNames() {
     return names;
 }
 
-Project::Project() : mGate(std::make_shared<Gate>()) {
+Project::Project() : Project(nullptr) {}
+
+Project::Project(MessageRegistrarPtr registrar) : mGate(std::make_shared<Gate>()) {
     mGate->project = this;
-    auto registrar = MessageRegistrar::Instance();
+    if (!registrar) registrar = MessageRegistrar::Instance();
+    mGate->registrar = registrar;
     auto add = [&](const char* op, Handler::RequestFn request, Handler::NotifyFn notify) {
         registrar->Register(Name(op), std::make_shared<Handler>(mGate, mGate->mutex, mGate->project, Name(op),
                                                                 std::move(request), std::move(notify)));
@@ -133,8 +137,7 @@ void Project::StopServing() {
         if (!mGate->project) return;
         mGate->project = nullptr;
     }
-    auto registrar = MessageRegistrar::Instance();
-    for (const auto& name : MessageNames()) registrar->UnRegister(name);
+    for (const auto& name : MessageNames()) mGate->registrar->UnRegister(name);
 }
 
 void Project::CreateItemsFromXML(const std::string&) {}

@@ -2,7 +2,8 @@
 // answers the requests hosts send through tidelink::Project.
 //
 // Constructing the object registers one handler per message with the process's message
-// registrar; each handler reads the arguments and calls the matching virtual operation. Requests
+// registrar (or with the registrar given, for a peer that answers through a registrar of its
+// own); each handler reads the arguments and calls the matching virtual operation. Requests
 // whose arguments do not fit are refused with -10004 and a message naming the request. Request
 // operations answer through the responder, from any thread, once.
 //
@@ -28,6 +29,8 @@ using platform::ResponderPtr;
 class TIDELINK_EXPORT Project {
 public:
     Project();
+    // Registers on |registrar| instead of the process's (null: the process's).
+    explicit Project(platform::MessageRegistrarPtr registrar);
     virtual ~Project();
     Project(const Project&) = delete;
     Project& operator=(const Project&) = delete;
