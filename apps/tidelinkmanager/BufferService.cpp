@@ -120,6 +120,9 @@ struct BufferService::Impl {
 
     mutable std::mutex mutex;
     bool stopped = false;
+    // Allocations creating their object outside the lock; stopping waits for them, so that no
+    // object is created after the service has let its objects go.
+    int creating = 0;
     std::map<std::string, Buffer> buffers;  // live: someone holds them
     std::deque<Buffer> pool;                // nobody holds them; oldest first
     uint64_t pooledBytes = 0;
@@ -293,19 +296,24 @@ struct BufferService::Impl {
             }
             // Reserve the bytes against the cap before creating outside the lock.
             c->pendingBytes += size;
+            ++creating;
         }
         // Creating and reserving the pages may take a while for large buffers.
         auto object = std::make_unique<MemoryMappedFile>();
         const std::string name = BufferNamePrefix() + RandomHex(12) + suffix;
         const bool ok = object->Init(name, size, 0);
-        std::lock_guard lock(mutex);
+        std::unique_lock lock(mutex);
+        if (--creating == 0) wake.notify_all();
         Client* c = FindClient(session, false);
         if (c != nullptr) c->pendingBytes -= size;
         if (!ok) {
             TL_TRACE(kCat, 1) << "Cannot create a buffer of " << size << " bytes: errno " << object->LastError();
             return r->SendGeneralResult(Description(-1));
         }
-        if (c == nullptr) return r->SendGeneralResult(Description(-1));  // object removed with it
+        if (c == nullptr) {
+            object.reset();  // removed now, while the lock holds back a stop
+            return r->SendGeneralResult(Description(-1));
+        }
         ++objectsCreated;
         ++allocations;
         b.name = name;
@@ -610,8 +618,10 @@ void BufferService::OnStop() {
     std::map<std::string, Buffer> buffers;
     std::deque<Buffer> pool;
     {
-        std::lock_guard lock(mImpl->mutex);
+        std::unique_lock lock(mImpl->mutex);
         mImpl->stopped = true;
+        // An object being created now is removed by its allocation, which finds no client.
+        mImpl->wake.wait_for(lock, std::chrono::seconds(5), [&] { return mImpl->creating == 0; });
         buffers.swap(mImpl->buffers);
         pool.swap(mImpl->pool);
         mImpl->published.clear();

@@ -230,7 +230,7 @@ TEST(PeerLinks, FailuresReachTheCallbackOnce) {
     std::ofstream(dir / "broken.kstproj") << "{ not json";
     std::vector<std::string> progress;
     std::mutex progressMutex;
-    server->SetProgressCallback([&](const std::string& m, double f, const std::vector<WString>&) {
+    server->SetProgressCallback([&](const std::string& m, double, const std::vector<WString>&) {
         std::lock_guard lock(progressMutex);
         if (m.rfind("$$$/tidelink/tidelink/OpenProjectFailed=", 0) == 0) progress.push_back(m);
     });
