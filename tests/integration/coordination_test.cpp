@@ -15,6 +15,7 @@
 #include "processcoordination/MappedAudioData.h"
 #include "processcoordination/ProcessCoordination.h"
 #include "tidelink/core/LinkManager.h"
+#include "tidelink/peers/Source.h"
 
 using namespace tidelink;
 using namespace tidelink::platform;
@@ -241,6 +242,40 @@ TEST_F(CoordinationTest, AnAudioChunkHandedOverWhileMappedIsLetGoAfterwards) {
     }
     EXPECT_EQ(consumer.Line(), "result 0 size 8320 sum " + std::to_string(sum));
     EXPECT_EQ(consumer.Wait(), 0);
+}
+
+TEST_F(CoordinationTest, FramesOfAProcessWithoutTheClientFailWithNoClient) {
+    // Once the last user has let the client go, this process has none (it is started once); a
+    // renderer's frames and chunks then fail with -5, on an executor, and send nothing.
+    UninitializeClient();
+    auto reconnect = ServerReconnect::Create(nullptr, false);
+    SourceInfo info;
+    info.mID = Guid::New();
+    info.mParentProjectFile = "/nowhere/p.kstproj";
+    auto source = Source::CreateSource(reconnect, nullptr);
+    source->Init(info);
+    Gate started;
+    VideoRendererPtr renderer;
+    source->GetVideoRenderer(
+        [&](ConnectionStatus, VideoRendererPtr r) {
+            renderer = std::move(r);
+            started.Open();
+        },
+        VideoRenderOptions());
+    ASSERT_TRUE(started.Wait(10000));
+    ASSERT_TRUE(renderer);
+    Gate failed;
+    std::atomic<int> result{0};
+    renderer->RenderVideo(
+        [&](const Guid&, BinaryReferencePtr ref, int code) {
+            result = ref ? 99 : code;
+            failed.Open();
+        },
+        Guid::New(), RatioTime(0));
+    ASSERT_TRUE(failed.Wait(10000));
+    EXPECT_EQ(result.load(), -5);
+    renderer.reset();
+    InitializeClient();  // balances the fixture's teardown
 }
 
 TEST_F(CoordinationTest, TwoWaitersInOrderAndCancel) {
