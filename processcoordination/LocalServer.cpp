@@ -122,6 +122,8 @@ public:
 
     void UnmapFromCurrentProcess(Pointer inData) override {
         RecursiveMutex::Guard guard(mOwner->Mutex(), "LocalReference::UnmapFromCurrentProcess");
+        // Handed over: its mapping went back then, and the producer's unmap has nothing to undo.
+        if (mName.empty()) return;
         if (!mMemoryMappedFile || mMemoryMappedFile->GetAddress() != inData) throw ContractViolation();
         if (--mMapCount == 0) ReturnCachedMemoryMappedFile(mName, std::move(mMemoryMappedFile));
     }

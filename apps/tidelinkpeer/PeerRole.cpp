@@ -140,6 +140,7 @@ std::string PeerUsage() {
            "  --no-announce      listen, but never announce to the link manager (tests)\n"
            "  -v, --loglevel L   quiet, error, warning, info, verbose, debug or trace\n"
            "                     (TIDELINK_TRACE overrides it)\n"
+           "TIDELINK_RENDER_THREADS sets the threads that draw frames (default: cores + 2).\n"
            "Normally started by the link manager. Prints \"listening on ADDRESS:PORT\" once it serves.\n";
 }
 

@@ -138,7 +138,8 @@ void RenderService::Unregister(const MessageRegistrarPtr& registrar) {
 void RenderService::EnsureCoordination() {
     if (mCoordination.load()) return;
     std::lock_guard lock(mCoordinationMutex);
-    if (mCoordination.load()) return;
+    // Not again once shutdown began: a frame that slipped in then fails with no client (-5).
+    if (mCoordination.load() || mStopping.load()) return;
     // Starts in the background; the first buffer request waits for it.
     pc::InitializeClient();
     mCoordination.store(true);

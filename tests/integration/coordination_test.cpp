@@ -12,8 +12,10 @@
 #include "Harness.h"
 #include "platform/Rpc.h"
 #include "platform/Sync.h"
+#include "processcoordination/MappedAudioData.h"
 #include "processcoordination/ProcessCoordination.h"
 #include "tidelink/core/LinkManager.h"
+#include "tidelink/peers/Source.h"
 
 using namespace tidelink;
 using namespace tidelink::platform;
@@ -219,6 +221,61 @@ TEST_F(CoordinationTest, LocalDataAliasesAndTheSingleDrop) {
     BinaryReferencePtr gone;
     EXPECT_EQ(GetBinaryDataIfAvailable(alias, gone), -1);
     EXPECT_EQ(IsBinaryDataCurrentlyAvailable(id), -1);
+}
+
+TEST_F(CoordinationTest, AnAudioChunkHandedOverWhileMappedIsLetGoAfterwards) {
+    // A producer publishes its chunk with hand-over while the MappedAudioData still maps it, then
+    // lets the object go: the unmap of a handed-over reference has nothing to undo.
+    const Guid id = Guid::New();
+    Peer consumer({"consume", id.ToString()});
+    uint64_t sum = 0;
+    {
+        MappedAudioData chunk;
+        ASSERT_EQ(chunk.Init(2, 1024, id), 0);
+        float** planes = chunk.GetAudioDataBuffer();
+        for (uint32_t c = 0; c < 2; ++c) {
+            for (uint32_t i = 0; i < 1024; ++i) planes[c][i] = static_cast<float>(c * 1024 + i) / 2048.0f;
+        }
+        const auto* bytes = reinterpret_cast<const uint8_t*>(planes[0]) - kAudioChunkHeaderBytes;
+        for (uint64_t i = 0; i < kAudioChunkHeaderBytes + 2 * 1024 * 4; ++i) sum += bytes[i];
+        ASSERT_EQ(PutCompletedBinaryData(id, chunk.GetWritablePtr(), true), 0);
+    }
+    EXPECT_EQ(consumer.Line(), "result 0 size 8320 sum " + std::to_string(sum));
+    EXPECT_EQ(consumer.Wait(), 0);
+}
+
+TEST_F(CoordinationTest, FramesOfAProcessWithoutTheClientFailWithNoClient) {
+    // Once the last user has let the client go, this process has none (it is started once); a
+    // renderer's frames and chunks then fail with -5, on an executor, and send nothing.
+    UninitializeClient();
+    auto reconnect = ServerReconnect::Create(nullptr, false);
+    SourceInfo info;
+    info.mID = Guid::New();
+    info.mParentProjectFile = "/nowhere/p.kstproj";
+    auto source = Source::CreateSource(reconnect, nullptr);
+    source->Init(info);
+    Gate started;
+    VideoRendererPtr renderer;
+    source->GetVideoRenderer(
+        [&](ConnectionStatus, VideoRendererPtr r) {
+            renderer = std::move(r);
+            started.Open();
+        },
+        VideoRenderOptions());
+    ASSERT_TRUE(started.Wait(10000));
+    ASSERT_TRUE(renderer);
+    Gate failed;
+    std::atomic<int> result{0};
+    renderer->RenderVideo(
+        [&](const Guid&, BinaryReferencePtr ref, int code) {
+            result = ref ? 99 : code;
+            failed.Open();
+        },
+        Guid::New(), RatioTime(0));
+    ASSERT_TRUE(failed.Wait(10000));
+    EXPECT_EQ(result.load(), -5);
+    renderer.reset();
+    InitializeClient();  // balances the fixture's teardown
 }
 
 TEST_F(CoordinationTest, TwoWaitersInOrderAndCancel) {

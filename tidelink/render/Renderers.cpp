@@ -22,6 +22,13 @@ std::string Message(const char* name) { return std::string(kPrefix) + name; }
 
 Value TimeValue(const RatioTime& t) { return RatioTimeToValue(t); }
 
+// Where a frame's failure is delivered: the coordination client's delivery executor, or the
+// library's shared executor when the process has no client (the failure is then -5).
+ExecutorPtr Delivery() {
+    if (auto executor = pc::GetDeliveryExecutor()) return executor;
+    return GetSharedExecutor();
+}
+
 // Sends |call| once the coordination client's registration is acknowledged; a failed send
 // completes the frame through the coordination client with the mapped code.
 pc::RegistrationCallback SendOnRegistration(const ServerReconnectPtr& reconnect, Call call, const Guid& frameID) {
@@ -41,7 +48,7 @@ pc::RegistrationCallback SendOnRegistration(const ServerReconnectPtr& reconnect,
 void RegisterAndSend(pc::AvailabilityCallback callback, const Guid& frameID, pc::RegistrationCallback send) {
     const int result = pc::GetBinaryDataWithAsyncNotification(frameID, callback, std::move(send));
     if (result != 0) {
-        pc::GetDeliveryExecutor()->Post([callback, frameID, result] { callback(frameID, nullptr, result); });
+        Delivery()->Post([callback, frameID, result] { callback(frameID, nullptr, result); });
     }
 }
 
@@ -293,7 +300,7 @@ void AudioRenderer::RenderAudio(pc::AvailabilityCallback callback, const Guid& f
 void AudioRenderer::RenderAudioAtTime(pc::AvailabilityCallback callback, const Guid& frameID, const RatioTime& time) {
     const int result = pc::GetBinaryDataWithAsyncNotification(frameID, callback);
     if (result != 0) {
-        pc::GetDeliveryExecutor()->Post([callback, frameID, result] { callback(frameID, nullptr, result); });
+        Delivery()->Post([callback, frameID, result] { callback(frameID, nullptr, result); });
         return;
     }
     SendOnRegistration(mReconnect,
