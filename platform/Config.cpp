@@ -60,8 +60,8 @@ struct ClientInfo {
 };
 
 ClientInfo& GetClientInfo() {
-    static ClientInfo info;
-    return info;
+    static auto* info = new ClientInfo();  // immortal: read by work that may outlive main
+    return *info;
 }
 
 std::string Trim(std::string s) {

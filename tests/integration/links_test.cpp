@@ -44,6 +44,15 @@ struct Result {
     };
     std::shared_ptr<State> state = std::make_shared<State>();
 
+    Result() = default;
+    Result(const Result&) = delete;
+    // A server, project or source keeps the callback it was made with: drop what it delivered so
+    // that nothing keeps itself alive.
+    ~Result() {
+        std::lock_guard lock(state->mutex);
+        state->value = T{};
+    }
+
     auto Callback() {
         auto s = state;
         return [s](ConnectionStatus status, T value) {

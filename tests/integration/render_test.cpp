@@ -47,6 +47,14 @@ struct Outcome {
         std::tuple<T...> values;
     };
     std::shared_ptr<State> state = std::make_shared<State>();
+    Outcome() = default;
+    Outcome(const Outcome&) = delete;
+    // The callback may live on inside the object it delivered (a source keeps its creation
+    // callback): drop what it delivered so that nothing keeps itself alive.
+    ~Outcome() {
+        std::lock_guard lock(state->mutex);
+        state->values = {};
+    }
     auto Callback() {
         auto s = state;
         return [s](T... v) {

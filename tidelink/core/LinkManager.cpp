@@ -87,11 +87,12 @@ void LaunchManagerProcess() {
 }  // namespace
 
 WString GetTideLinkProtocolVersion() {
-    static const WString version = [] {
+    // Immortal, like the state: a reconnection may still ask for it while the process exits.
+    static const WString& version = *new WString([] {
         char buf[32];
         std::snprintf(buf, sizeof(buf), "%i.%i", GetSuiteVersionInfo().major, 0);
         return ToUTF16(buf);
-    }();
+    }());
     return version;
 }
 
