@@ -575,7 +575,15 @@ TEST_F(RenderTest, APeerKilledMidRenderCompletesEveryFrame) {
                  1920, 1080);
     EXPECT_EQ(replacements.load(), 0);
 
-    // A renderer destroyed with frames on the way: late answers find nothing to call into.
-    for (int i = 0; i < 4; ++i) render(i);
+    // A renderer destroyed with frames on the way: each frame still completes once, and the late
+    // answers find no renderer to call into.
+    auto late = std::make_shared<std::atomic<int>>(0);
+    for (int i = 0; i < 4; ++i) {
+        renderer->RenderVideo([late](const Guid&, pc::BinaryReferencePtr, int) { ++*late; }, Guid::New(),
+                              FrameTime(source, i));
+    }
     renderer.reset();
+    EXPECT_TRUE(WaitFor([&] { return late->load() == 4; }, 30));
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    EXPECT_EQ(late->load(), 4);
 }
