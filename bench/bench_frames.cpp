@@ -21,6 +21,7 @@
 #include <string>
 #include <vector>
 
+#include "LinkBench.h"
 #include "platform/Config.h"
 #include "platform/Process.h"
 #include "platform/Rpc.h"
@@ -35,6 +36,8 @@
 
 using namespace tidelink;
 using namespace tidelink::platform;
+using bench::Await;
+using bench::ManagerInfo;
 namespace pc = processcoordination;
 
 namespace {
@@ -53,26 +56,6 @@ constexpr Size kSizes[] = {{"360p", u"Fill 360p", 640, 360},
                            {"2160p", u"Fill 2160p", 3840, 2160}};
 constexpr int kDepths[] = {1, 2, 8};
 constexpr uint32_t kChunks[] = {1024, 4800};
-
-template <class T>
-struct Await {
-    std::shared_ptr<Gate> gate = std::make_shared<Gate>();
-    std::shared_ptr<std::pair<ConnectionStatus, T>> result =
-        std::make_shared<std::pair<ConnectionStatus, T>>(ConnectionStatus::Failed, T{});
-    auto Callback() {
-        auto g = gate;
-        auto r = result;
-        return [g, r](ConnectionStatus s, T v) {
-            if (g->IsOpen()) return;
-            *r = {s, std::move(v)};
-            g->Open();
-        };
-    }
-    T Get(double seconds = 60) {
-        if (!gate->Wait(static_cast<int>(seconds * 1000)) || result->first != ConnectionStatus::Connected) return T{};
-        return std::move(result->second);
-    }
-};
 
 uint64_t Sum(const void* data, uint64_t size) {
     const auto* p = static_cast<const uint64_t*>(data);
@@ -314,13 +297,7 @@ int main(int argc, char** argv) {
     server.reset();
     kestrel.reset();
     if (privateManager) {
-        Await<Value> info;
-        auto cb = info.Callback();
-        LaunchTidelinkManagerRPC()->SendRequest(
-            BuildCall(kManagerInfoMessage), [cb](const Value& v, RequestId) { cb(ConnectionStatus::Connected, v); },
-            [cb](int32_t, const WString&, RequestId) { cb(ConnectionStatus::Failed, Value()); });
-        const Value reply = info.Get(10);
-        const auto pid = reply.is_object() ? reply.value("value", Value::object()).value("pid", 0u) : 0u;
+        const auto pid = bench::ManagerInfo(10).value("pid", 0u);
         if (pid != 0) ::kill(static_cast<pid_t>(pid), SIGTERM);
     }
     pc::UninitializeClient();

@@ -19,6 +19,7 @@
 #include <string>
 #include <vector>
 
+#include "LinkBench.h"
 #include "platform/Config.h"
 #include "platform/Process.h"
 #include "platform/Rpc.h"
@@ -30,41 +31,12 @@
 
 using namespace tidelink;
 using namespace tidelink::platform;
+using bench::Await;
+using bench::ManagerInfo;
 
 namespace {
 
 const std::string kProject = std::string(TIDELINK_SOURCE_DIR) + "/examples/projects/demo.kstproj";
-
-template <class T>
-struct Await {
-    std::shared_ptr<Gate> gate = std::make_shared<Gate>();
-    std::shared_ptr<std::pair<ConnectionStatus, T>> result =
-        std::make_shared<std::pair<ConnectionStatus, T>>(ConnectionStatus::Failed, T{});
-    auto Callback() {
-        auto g = gate;
-        auto r = result;
-        return [g, r](ConnectionStatus s, T v) {
-            if (g->IsOpen()) return;
-            *r = {s, std::move(v)};
-            g->Open();
-        };
-    }
-    T Get(double seconds = 60) {
-        if (!gate->Wait(static_cast<int>(seconds * 1000)) || result->first != ConnectionStatus::Connected) return T{};
-        return std::move(result->second);  // a project keeps its open callback: do not keep the project here
-
-    }
-};
-
-Value ManagerInfo() {
-    Await<Value> info;
-    auto cb = info.Callback();
-    LaunchTidelinkManagerRPC()->SendRequest(
-        BuildCall(kManagerInfoMessage), [cb](const Value& v, RequestId) { cb(ConnectionStatus::Connected, v); },
-        [cb](int32_t, const WString&, RequestId) { cb(ConnectionStatus::Failed, Value()); });
-    const Value reply = info.Get();
-    return reply.is_object() ? reply.value("value", Value::object()) : Value::object();
-}
 
 std::vector<uint32_t> PeerPids() {
     std::vector<uint32_t> pids;

@@ -245,58 +245,43 @@ void Server::SendProjectRequest(const std::weak_ptr<Server>& weak, const ServerR
         fail);
 }
 
-void Server::OpenProject(ProjectCallback callback, const File& file) {
-    TL_TRACE(kCat, 7) << "OpenProject called with project: " << file.string();
+void Server::OpenOnConnection(Route route, const Value& target, Call call, ProjectCallback callback,
+                              bool reportConnecting, FarlandServerConnectInfo connectInfo) {
     std::weak_ptr<Server> weak = mWeakSelf;
     auto shared = std::make_shared<ProjectCallback>(std::move(callback));
     ObtainConnection(
-        Route::CreateLink, file.string(),
-        [weak, shared, file](const ServerReconnectPtr& link) {
-            SendProjectRequest(weak, link, BuildCall("com.quenlo.tidelink.OpenProject", Value::array({file.string()})),
-                                     *shared, true, {});
+        route, target,
+        [weak, shared, call = std::move(call), reportConnecting, connectInfo](const ServerReconnectPtr& link) {
+            SendProjectRequest(weak, link, call, *shared, reportConnecting, connectInfo);
         },
         [shared] { (*shared)(ConnectionStatus::Failed, nullptr); });
+}
+
+void Server::OpenProject(ProjectCallback callback, const File& file) {
+    TL_TRACE(kCat, 7) << "OpenProject called with project: " << file.string();
+    OpenOnConnection(Route::CreateLink, file.string(),
+                     BuildCall("com.quenlo.tidelink.OpenProject", Value::array({file.string()})), std::move(callback),
+                     true, {});
 }
 
 void Server::OpenProjectWithJSON(ProjectCallback callback, const File& file, const std::string& json) {
     TL_TRACE(kCat, 7) << "OpenProjectWithJSON called with project: " << file.string();
-    std::weak_ptr<Server> weak = mWeakSelf;
-    auto shared = std::make_shared<ProjectCallback>(std::move(callback));
-    ObtainConnection(
-        Route::CreateLink, file.string(),
-        [weak, shared, file, json](const ServerReconnectPtr& link) {
-            SendProjectRequest(
-                weak, link, BuildCall("com.quenlo.tidelink.OpenProjectWithJSON", Value::array({file.string(), json})),
-                *shared, true, {});
-        },
-        [shared] { (*shared)(ConnectionStatus::Failed, nullptr); });
+    OpenOnConnection(Route::CreateLink, file.string(),
+                     BuildCall("com.quenlo.tidelink.OpenProjectWithJSON", Value::array({file.string(), json})),
+                     std::move(callback), true, {});
 }
 
 void Server::CreateProject(ProjectCallback callback, const File& directory, const WString& projectName) {
-    std::weak_ptr<Server> weak = mWeakSelf;
-    auto shared = std::make_shared<ProjectCallback>(std::move(callback));
-    ObtainConnection(
-        Route::Headed, Value(),
-        [weak, shared, directory, projectName](const ServerReconnectPtr& link) {
-            SendProjectRequest(weak, link,
-                                     BuildCall("com.quenlo.tidelink.CreateProject",
-                                               Value::array({directory.string(), ToUTF8(projectName)})),
-                                     *shared, false, {});
-        },
-        [shared] { (*shared)(ConnectionStatus::Failed, nullptr); });
+    OpenOnConnection(Route::Headed, Value(),
+                     BuildCall("com.quenlo.tidelink.CreateProject",
+                               Value::array({directory.string(), ToUTF8(projectName)})),
+                     std::move(callback), false, {});
 }
 
 void Server::GetOpenProject(ProjectCallback callback, const FarlandProductionRequestInfo& request) {
-    std::weak_ptr<Server> weak = mWeakSelf;
-    auto shared = std::make_shared<ProjectCallback>(std::move(callback));
-    ObtainConnection(
-        Route::HeadedUnlessDirect, Value(),
-        [weak, shared, request](const ServerReconnectPtr& link) {
-            SendProjectRequest(weak, link,
-                                     BuildCall("com.quenlo.tidelink.GetOpenProject", Value::array({Value(request)})),
-                                     *shared, false, request.mServerConnectInfo);
-        },
-        [shared] { (*shared)(ConnectionStatus::Failed, nullptr); });
+    OpenOnConnection(Route::HeadedUnlessDirect, Value(),
+                     BuildCall("com.quenlo.tidelink.GetOpenProject", Value::array({Value(request)})),
+                     std::move(callback), false, request.mServerConnectInfo);
 }
 
 void Server::RuntimeFontChange(FontCallback callback) {

@@ -118,6 +118,9 @@ private:
     void Report(const char* message, double fraction, std::vector<WString> args = {});
     static void Report(const std::weak_ptr<Server>& weak, const char* message, double fraction,
                        std::vector<WString> args = {});
+    // Obtains the connection, then sends |call|, whose answer is a project.
+    void OpenOnConnection(Route route, const platform::Value& target, platform::Call call, ProjectCallback callback,
+                          bool reportConnecting, FarlandServerConnectInfo connectInfo);
     // The continuation shared by the operations that answer with a project.
     // Runs whether or not the server is still there; only progress needs it.
     static void SendProjectRequest(const std::weak_ptr<Server>& weak, const ServerReconnectPtr& link,

@@ -241,24 +241,14 @@ void Source::GetAudioRenderer(std::function<void(ConnectionStatus, AudioRenderer
 // ---- reconnection --------------------------------------------------------------------------
 
 void Source::OnReconnectStatus(ConnectionStatus status, const WString&, const File& file) {
-    if (status == ConnectionStatus::Failed) {
-        if (mCallback) mCallback(ConnectionStatus::Failed, nullptr);
-        return;
-    }
-    if (status != ConnectionStatus::Connected) return;
-    std::weak_ptr<Source> weak = mWeakSelf;
-    mReconnect->SendDirectRequest(
-        BuildCall(Message("GetSource"), Value::array({file.string(), mInfo.mID.ToString()})),
-        [weak](const Value& reply, RequestId) {
-            if (auto self = weak.lock()) self->OnReplacement(reply, false);
-        },
-        [weak](int32_t, const WString&, RequestId) {
-            if (auto self = weak.lock(); self && self->mCallback) self->mCallback(ConnectionStatus::Failed, nullptr);
-        },
-        true, 0);
+    AskAgain(status, BuildCall(Message("GetSource"), Value::array({file.string(), mInfo.mID.ToString()})), false);
 }
 
 void Source::OnFarlandReconnectStatus(ConnectionStatus status, const WString&, const GenericAssetInfo& asset) {
+    AskAgain(status, BuildCall(Message("GetFarlandSource"), Value::array({Value(asset), mInfo.mID.ToString()})), true);
+}
+
+void Source::AskAgain(ConnectionStatus status, const Call& call, bool farland) {
     if (status == ConnectionStatus::Failed) {
         if (mCallback) mCallback(ConnectionStatus::Failed, nullptr);
         return;
@@ -266,9 +256,9 @@ void Source::OnFarlandReconnectStatus(ConnectionStatus status, const WString&, c
     if (status != ConnectionStatus::Connected) return;
     std::weak_ptr<Source> weak = mWeakSelf;
     mReconnect->SendDirectRequest(
-        BuildCall(Message("GetFarlandSource"), Value::array({Value(asset), mInfo.mID.ToString()})),
-        [weak](const Value& reply, RequestId) {
-            if (auto self = weak.lock()) self->OnReplacement(reply, true);
+        call,
+        [weak, farland](const Value& reply, RequestId) {
+            if (auto self = weak.lock()) self->OnReplacement(reply, farland);
         },
         [weak](int32_t, const WString&, RequestId) {
             if (auto self = weak.lock(); self && self->mCallback) self->mCallback(ConnectionStatus::Failed, nullptr);

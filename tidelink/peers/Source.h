@@ -132,6 +132,8 @@ private:
     // |farlandArgs| follow the asset info.
     void Send(const char* plain, const char* farland, platform::Value plainArgs, platform::Value farlandArgs,
               platform::SuccessFn ok, platform::FailureFn fail);
+    // After a reconnection: asks for the description again with |call| (forced past the queue).
+    void AskAgain(ConnectionStatus status, const platform::Call& call, bool farland);
     void OnReplacement(const platform::Value& reply, bool farland);
 
     std::weak_ptr<Source> mWeakSelf;
